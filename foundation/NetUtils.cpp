@@ -1,0 +1,158 @@
+#include "foundation/NetUtils.h"
+
+#include <atomic>
+#include <cstdlib>
+#include <vector>
+
+#include "foundation/Logger.h"
+#include "platform/kernel.h"
+#include "platform/netinfo.h"
+
+namespace foundation {
+
+namespace {
+constexpr uint16_t kFirstRotatingPort = 10000;
+constexpr uint16_t kLastRotatingPort = 60000;
+constexpr int kRotatingBindAttempts = 100;
+
+// Shared by every thread; atomic so that two callers never race on the value itself (they may
+// still both try a port, and one bind then fails, which costs one attempt).
+std::atomic<uint16_t> g_nextPort{0};
+
+uint16_t TakeRotatingCandidate() {
+    uint16_t current = g_nextPort.load();
+    for (;;) {
+        uint16_t candidate = current;
+        if (candidate == 0) {
+            std::srand(platform::GetTickCount());
+            candidate = static_cast<uint16_t>(kFirstRotatingPort + std::rand() % 50001);
+        }
+        const uint16_t next = candidate >= kLastRotatingPort ? kFirstRotatingPort
+                                                             : static_cast<uint16_t>(candidate + 1);
+        if (g_nextPort.compare_exchange_weak(current, next)) {
+            return candidate;
+        }
+    }
+}
+}  // namespace
+
+namespace rotating_port {
+uint16_t Next() {
+    return g_nextPort.load();
+}
+void SetNext(uint16_t port) {
+    g_nextPort.store(port);
+}
+}  // namespace rotating_port
+
+uint32_t GetIPByName(const std::string& name, uint32_t notFoundValue) {
+    const uint32_t dotted = platform::InetAddrNet(name);
+    if (dotted != platform::kInaddrNone) {
+        return dotted;
+    }
+    uint32_t address = 0;
+    const int error = platform::ResolveHostNameNet(name, &address);
+    if (error == 0) {
+        return address;
+    }
+    if (error == platform::kErrHostNotFound) {
+        return notFoundValue;
+    }
+    NQ_LOG("GetIPByName", kLogError, "%s", "Failed Assertion - dwError == WSAHOST_NOT_FOUND");
+    return 0;
+}
+
+SocketHandle CreateUdpSocket(uint32_t localAddress, uint16_t* port) {
+    const SocketHandle s = platform::OpenUdpSocket();
+    if (s == kInvalidSocket) {
+        return kInvalidSocket;
+    }
+    if (port != nullptr && *port != 0) {
+        if (platform::BindSocket(s, localAddress, *port)) {
+            return s;
+        }
+        platform::CloseSocket(s);
+        return kInvalidSocket;
+    }
+    for (int attempt = 0; attempt < kRotatingBindAttempts; ++attempt) {
+        const uint16_t candidate = TakeRotatingCandidate();
+        if (platform::BindSocket(s, localAddress, candidate)) {
+            if (port != nullptr) {
+                *port = candidate;
+            }
+            return s;
+        }
+    }
+    platform::CloseSocket(s);
+    return kInvalidSocket;
+}
+
+int SendDatagram(SocketHandle s, const void* data, size_t length, uint32_t address, uint16_t port) {
+    return platform::SendTo(s, data, length, address, port);
+}
+
+int ReceiveDatagram(SocketHandle s, void* buffer, size_t capacity, uint32_t* fromAddress,
+                    uint16_t* fromPort, int timeoutMs) {
+    const int ready = platform::WaitSocketReadable(s, timeoutMs);
+    if (ready != 1) {
+        return ready;
+    }
+    uint32_t address = 0;
+    uint16_t port = 0;
+    const int n = platform::ReceiveFrom(s, buffer, capacity, &address, &port);
+    if (n < 1) {
+        return n;
+    }
+    if (fromAddress != nullptr) {
+        *fromAddress = address;
+    }
+    if (fromPort != nullptr) {
+        *fromPort = port;
+    }
+    return n;
+}
+
+int32_t QueryUdpInDatagrams(uint32_t* count) {
+    uint32_t value = 0;
+    const int error = platform::CurrentNetworkInfo().UdpInDatagrams(value);
+    if (error != 0) {
+        return static_cast<int32_t>(0x80070000u | (static_cast<uint32_t>(error) & 0xFFFFu));
+    }
+    *count = value;
+    return 0;
+}
+
+bool GetInterfaceAddressAndGateway(uint32_t interfaceIndex, std::string& address,
+                                   std::string& gateway) {
+    std::vector<platform::AdapterInfo> adapters;
+    if (!platform::CurrentNetworkInfo().Adapters(adapters)) {
+        return false;
+    }
+    for (const auto& a : adapters) {
+        if (!a.gateway.empty() && a.index == interfaceIndex) {
+            gateway = a.gateway;
+            address = a.addresses.empty() ? std::string() : a.addresses.front();
+            return true;
+        }
+    }
+    return false;
+}
+
+std::string GetGatewayForLocalAddress(const std::string& address) {
+    std::vector<platform::AdapterInfo> adapters;
+    if (!platform::CurrentNetworkInfo().Adapters(adapters)) {
+        return {};
+    }
+    for (const auto& a : adapters) {
+        if (!a.gateway.empty() && !a.addresses.empty() && a.addresses.front() == address) {
+            return a.gateway;
+        }
+    }
+    return {};
+}
+
+std::string FormatHostAddress(uint32_t hostAddress) {
+    return platform::InetNtoaNet(platform::HostToNet32(hostAddress));
+}
+
+}  // namespace foundation

@@ -1,0 +1,57 @@
+// Small IPv4 routines shared by everything above: name resolution, UDP sockets on a chosen or a
+// rotating port, single datagrams with a timeout, and the host's UDP receive counter.
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <string>
+
+#include "platform/net.h"
+
+namespace foundation {
+
+using platform::kInvalidSocket;
+using platform::SocketHandle;
+
+inline constexpr uint32_t kAddressNone = 0xFFFFFFFFu;
+
+// Dotted quad or host name to a network-order address. A dotted quad needs no look-up. A name
+// nobody knows gives notFoundValue without a log line (0 for the keep-alive refresh,
+// kAddressNone for the SIP socket and proxy); any other resolver failure logs at ERROR and
+// gives 0.
+uint32_t GetIPByName(const std::string& name, uint32_t notFoundValue = 0);
+
+// Binds a new UDP socket on localAddress (host order, 0 for any). port absent or 0 takes the
+// process-wide rotating port (10000..60000); a present 0 receives the bound port. A non-zero
+// port binds exactly that port or fails. Returns kInvalidSocket on failure.
+SocketHandle CreateUdpSocket(uint32_t localAddress, uint16_t* port);
+
+// sendto result: bytes sent or the socket error value.
+int SendDatagram(SocketHandle s, const void* data, size_t length, uint32_t address, uint16_t port);
+
+// Waits up to timeoutMs (-1: no limit) for one datagram. Returns the byte count (sender written
+// in host order), 0 on timeout, or the socket error value; out values untouched unless bytes
+// were received. A datagram longer than the buffer is an error, and so is a stop request of the
+// calling thread's owner.
+int ReceiveDatagram(SocketHandle s, void* buffer, size_t capacity, uint32_t* fromAddress,
+                    uint16_t* fromPort, int timeoutMs);
+
+// The host-wide count of UDP datagrams received. Returns 0 (S_OK) or 0x80070000 | error.
+int32_t QueryUdpInDatagrams(uint32_t* count);
+
+// Adapter queries: an adapter is an interface, its first IPv4 address is its primary address
+// and its gateway is the gateway of a default route through it.
+bool GetInterfaceAddressAndGateway(uint32_t interfaceIndex, std::string& address,
+                                   std::string& gateway);
+std::string GetGatewayForLocalAddress(const std::string& address);
+
+// Dotted text of a host-order address.
+std::string FormatHostAddress(uint32_t hostAddress);
+
+namespace rotating_port {
+// The shared next candidate (0 until first use). Exposed so the sequence can be checked.
+uint16_t Next();
+void SetNext(uint16_t port);
+}  // namespace rotating_port
+
+}  // namespace foundation

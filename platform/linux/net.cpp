@@ -1,0 +1,224 @@
+#include "platform/net.h"
+
+#include <arpa/inet.h>
+#include <dirent.h>
+#include <netdb.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "platform/kernel.h"
+
+namespace platform {
+
+namespace {
+thread_local int t_lastError = 0;
+
+int SetError(int e) {
+    t_lastError = e;
+    return kSocketError;
+}
+
+sockaddr_in MakeAddress(uint32_t hostAddress, uint16_t port) {
+    sockaddr_in sa{};
+    sa.sin_family = AF_INET;
+    sa.sin_addr.s_addr = htonl(hostAddress);
+    sa.sin_port = htons(port);
+    return sa;
+}
+}  // namespace
+
+int LastSocketError() {
+    return t_lastError;
+}
+
+uint32_t HostToNet32(uint32_t v) {
+    return htonl(v);
+}
+uint32_t NetToHost32(uint32_t v) {
+    return ntohl(v);
+}
+uint16_t HostToNet16(uint16_t v) {
+    return htons(v);
+}
+uint16_t NetToHost16(uint16_t v) {
+    return ntohs(v);
+}
+
+uint32_t InetAddrNet(const std::string& text) {
+    return inet_addr(text.c_str());
+}
+
+std::string InetNtoaNet(uint32_t netAddress) {
+    in_addr a{};
+    a.s_addr = netAddress;
+    char buf[INET_ADDRSTRLEN] = {};
+    inet_ntop(AF_INET, &a, buf, sizeof buf);
+    return buf;
+}
+
+int ResolveHostNameNet(const std::string& name, uint32_t* netAddress) {
+    addrinfo hints{};
+    hints.ai_family = AF_INET;
+    hints.ai_socktype = SOCK_DGRAM;
+    addrinfo* list = nullptr;
+    const int rc = getaddrinfo(name.c_str(), nullptr, &hints, &list);
+    if (rc != 0) {
+        switch (rc) {
+            case EAI_NONAME:
+#ifdef EAI_NODATA
+            case EAI_NODATA:
+#endif
+            case EAI_FAMILY:
+                t_lastError = kErrHostNotFound;
+                break;
+            case EAI_AGAIN:
+                t_lastError = kErrTryAgain;
+                break;
+            default:
+                t_lastError = kErrNoRecovery;
+                break;
+        }
+        return t_lastError;
+    }
+    int result = kErrNoData;
+    for (addrinfo* p = list; p != nullptr; p = p->ai_next) {
+        if (p->ai_family == AF_INET && p->ai_addr != nullptr) {
+            sockaddr_in sa{};
+            std::memcpy(&sa, p->ai_addr, sizeof sa);
+            *netAddress = sa.sin_addr.s_addr;
+            result = 0;
+            break;
+        }
+    }
+    freeaddrinfo(list);
+    t_lastError = result;
+    return result;
+}
+
+SocketHandle OpenUdpSocket() {
+    const int s = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, IPPROTO_UDP);
+    if (s < 0) {
+        t_lastError = errno;
+        return kInvalidSocket;
+    }
+    return s;
+}
+
+SocketHandle OpenTcpSocket() {
+    const int s = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, IPPROTO_TCP);
+    if (s < 0) {
+        t_lastError = errno;
+        return kInvalidSocket;
+    }
+    return s;
+}
+
+bool SetReuseAddress(SocketHandle s, bool on) {
+    const int value = on ? 1 : 0;
+    if (setsockopt(s, SOL_SOCKET, SO_REUSEADDR, &value, sizeof value) != 0) {
+        t_lastError = errno;
+        return false;
+    }
+    return true;
+}
+
+bool BindSocket(SocketHandle s, uint32_t hostAddress, uint16_t port) {
+    const sockaddr_in sa = MakeAddress(hostAddress, port);
+    if (bind(s, reinterpret_cast<const sockaddr*>(&sa), sizeof sa) != 0) {
+        t_lastError = errno;
+        return false;
+    }
+    return true;
+}
+
+bool GetSocketName(SocketHandle s, uint32_t* hostAddress, uint16_t* port) {
+    sockaddr_in sa{};
+    socklen_t len = sizeof sa;
+    if (getsockname(s, reinterpret_cast<sockaddr*>(&sa), &len) != 0) {
+        t_lastError = errno;
+        return false;
+    }
+    if (hostAddress != nullptr) {
+        *hostAddress = ntohl(sa.sin_addr.s_addr);
+    }
+    if (port != nullptr) {
+        *port = ntohs(sa.sin_port);
+    }
+    return true;
+}
+
+void CloseSocket(SocketHandle s) {
+    if (s != kInvalidSocket) {
+        close(s);
+    }
+}
+
+int SendTo(SocketHandle s, const void* data, size_t length, uint32_t hostAddress, uint16_t port) {
+    const sockaddr_in sa = MakeAddress(hostAddress, port);
+    const ssize_t n =
+        sendto(s, data, length, MSG_NOSIGNAL, reinterpret_cast<const sockaddr*>(&sa), sizeof sa);
+    if (n < 0) {
+        return SetError(errno);
+    }
+    return static_cast<int>(n);
+}
+
+int WaitSocketReadable(SocketHandle s, int timeoutMs) {
+    if (s == kInvalidSocket) {
+        return SetError(EBADF);
+    }
+    switch (WaitReadable(s, timeoutMs)) {
+        case WaitResult::Signaled:
+            return 1;
+        case WaitResult::Timeout:
+            return 0;
+        case WaitResult::Stopped:
+            return SetError(kErrInterrupted);
+        case WaitResult::Failed:
+            break;
+    }
+    return SetError(errno);
+}
+
+int ReceiveFrom(SocketHandle s, void* buffer, size_t capacity, uint32_t* fromHostAddress,
+                uint16_t* fromPort) {
+    sockaddr_in sa{};
+    socklen_t len = sizeof sa;
+    // MSG_TRUNC makes the kernel report the real size, so a cut datagram can be refused.
+    const ssize_t n =
+        recvfrom(s, buffer, capacity, MSG_TRUNC, reinterpret_cast<sockaddr*>(&sa), &len);
+    if (n < 0) {
+        return SetError(errno);
+    }
+    if (static_cast<size_t>(n) > capacity) {
+        return SetError(kErrMessageSize);
+    }
+    if (fromHostAddress != nullptr) {
+        *fromHostAddress = ntohl(sa.sin_addr.s_addr);
+    }
+    if (fromPort != nullptr) {
+        *fromPort = ntohs(sa.sin_port);
+    }
+    return static_cast<int>(n);
+}
+
+int CountOpenDescriptors() {
+    DIR* dir = opendir("/proc/self/fd");
+    if (dir == nullptr) {
+        return -1;
+    }
+    int count = 0;
+    while (dirent* e = readdir(dir)) {
+        if (e->d_name[0] != '.') {
+            ++count;
+        }
+    }
+    closedir(dir);
+    return count - 1;  // the directory stream itself
+}
+
+}  // namespace platform

@@ -1,8 +1,16 @@
 // The nqpm subcommands. Each takes the arguments after its name and returns the exit code.
 #pragma once
 
+#include <string>
+
+#include "stun/STUNResults.h"
+
 namespace nqpm {
 
 int RunBinding(int argc, char** argv);
+int RunClassify(int argc, char** argv);
+
+// {"results":[{"local":..,"result":..,"code":..,"public":..|null}],"text":..}
+std::string ClassificationJson(const stun::STUNResultList& list);
 
 }  // namespace nqpm

@@ -17,6 +17,7 @@ struct Command {
 
 const Command kCommands[] = {
     {"binding", nqpm::RunBinding, "one STUN Binding transaction against a server"},
+    {"classify", nqpm::RunClassify, "the NAT type in front of a local address"},
 };
 
 void PrintUsage(std::FILE* out) {

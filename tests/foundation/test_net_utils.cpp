@@ -1,0 +1,296 @@
+#include <gtest/gtest.h>
+
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "foundation/Logger.h"
+#include "foundation/NetUtils.h"
+#include "foundation/NetworkEndpoint.h"
+#include "foundation/UdpSocket.h"
+#include "platform/kernel.h"
+#include "platform/net.h"
+#include "platform/netinfo.h"
+
+namespace {
+
+using foundation::CreateUdpSocket;
+using foundation::GetIPByName;
+using foundation::kAddressNone;
+using foundation::ReceiveDatagram;
+using foundation::SendDatagram;
+
+constexpr uint32_t kLoopback = 0x7F000001;
+
+// Closes what the test opened.
+struct Socket {
+    explicit Socket(platform::SocketHandle h) : handle(h) {}
+    ~Socket() { platform::CloseSocket(handle); }
+    uint16_t Port() const {
+        uint16_t port = 0;
+        platform::GetSocketName(handle, nullptr, &port);
+        return port;
+    }
+    platform::SocketHandle handle;
+};
+
+TEST(GetIPByName, DottedQuadIsReturnedInNetworkOrderWithoutLookUp) {
+    const uint32_t a = GetIPByName("10.1.2.3");
+    EXPECT_EQ(platform::NetToHost32(a), 0x0A010203u);
+    EXPECT_EQ(GetIPByName("10.1.2.3", kAddressNone), a);
+}
+
+TEST(GetIPByName, LocalhostResolves) {
+    EXPECT_EQ(platform::NetToHost32(GetIPByName("localhost")), kLoopback);
+}
+
+TEST(CreateUdpSocket, RotatingPortsContinueTheSequenceAcrossCallers) {
+    foundation::rotating_port::SetNext(40000);
+    uint16_t first = 0;
+    Socket a(CreateUdpSocket(kLoopback, &first));
+    ASSERT_NE(a.handle, platform::kInvalidSocket);
+    uint16_t second = 0;
+    Socket b(CreateUdpSocket(kLoopback, &second));
+    ASSERT_NE(b.handle, platform::kInvalidSocket);
+    EXPECT_GE(first, 40000);
+    EXPECT_GT(second, first);
+    EXPECT_EQ(a.Port(), first);
+    EXPECT_EQ(b.Port(), second);
+    EXPECT_EQ(foundation::rotating_port::Next(), second + 1);
+    // An absent port still advances the shared sequence without reporting it.
+    Socket c(CreateUdpSocket(kLoopback, nullptr));
+    ASSERT_NE(c.handle, platform::kInvalidSocket);
+    EXPECT_GT(c.Port(), second);
+}
+
+TEST(CreateUdpSocket, WrapsFrom60000To10000) {
+    foundation::rotating_port::SetNext(60000);
+    Socket probe(platform::OpenUdpSocket());
+    if (!platform::BindSocket(probe.handle, kLoopback, 60000)) {
+        GTEST_SKIP() << "port 60000 is in use on this machine";
+    }
+    platform::CloseSocket(probe.handle);
+    probe.handle = platform::kInvalidSocket;
+    uint16_t port = 0;
+    Socket s(CreateUdpSocket(kLoopback, &port));
+    EXPECT_EQ(port, 60000);
+    EXPECT_EQ(foundation::rotating_port::Next(), 10000);
+}
+
+TEST(CreateUdpSocket, FirstUseSeedsACandidateInTheRange) {
+    foundation::rotating_port::SetNext(0);
+    uint16_t port = 0;
+    Socket s(CreateUdpSocket(kLoopback, &port));
+    ASSERT_NE(s.handle, platform::kInvalidSocket);
+    EXPECT_GE(port, 10000);
+    EXPECT_LE(port, 60000);
+}
+
+TEST(CreateUdpSocket, TakenExactPortFailsAtOnceAndLeavesTheSequenceAlone) {
+    uint16_t taken = 0;
+    Socket holder(CreateUdpSocket(kLoopback, &taken));
+    ASSERT_NE(holder.handle, platform::kInvalidSocket);
+    const uint16_t next = foundation::rotating_port::Next();
+    uint16_t again = taken;
+    EXPECT_EQ(CreateUdpSocket(kLoopback, &again), platform::kInvalidSocket);
+    EXPECT_EQ(again, taken);
+    EXPECT_EQ(foundation::rotating_port::Next(), next);
+}
+
+TEST(CreateUdpSocket, TakenRotatingCandidateIsSkipped) {
+    uint16_t taken = 0;
+    Socket holder(CreateUdpSocket(kLoopback, &taken));
+    ASSERT_NE(holder.handle, platform::kInvalidSocket);
+    foundation::rotating_port::SetNext(taken);
+    uint16_t port = 0;
+    Socket s(CreateUdpSocket(kLoopback, &port));
+    ASSERT_NE(s.handle, platform::kInvalidSocket);
+    EXPECT_NE(port, taken);
+}
+
+TEST(ReceiveDatagram, TimesOutWithoutTouchingTheOutValues) {
+    uint16_t port = 0;
+    Socket s(CreateUdpSocket(kLoopback, &port));
+    char buf[16];
+    uint32_t from = 0xDEADBEEF;
+    uint16_t fromPort = 0xBEEF;
+    EXPECT_EQ(ReceiveDatagram(s.handle, buf, sizeof buf, &from, &fromPort, 0), 0);
+    const uint64_t start = platform::GetTickCount64();
+    EXPECT_EQ(ReceiveDatagram(s.handle, buf, sizeof buf, &from, &fromPort, 1500), 0);
+    const uint64_t spent = platform::GetTickCount64() - start;
+    EXPECT_GE(spent, 1490u);
+    EXPECT_LT(spent, 2500u);
+    EXPECT_EQ(from, 0xDEADBEEFu);
+    EXPECT_EQ(fromPort, 0xBEEFu);
+}
+
+TEST(ReceiveDatagram, ReportsTheSenderInHostOrder) {
+    uint16_t rxPort = 0;
+    Socket rx(CreateUdpSocket(kLoopback, &rxPort));
+    uint16_t txPort = 0;
+    Socket tx(CreateUdpSocket(kLoopback, &txPort));
+    const char payload[] = {0, 1, 2, 3};
+    ASSERT_EQ(SendDatagram(tx.handle, payload, sizeof payload, kLoopback, rxPort), 4);
+    char buf[16] = {};
+    uint32_t from = 0;
+    uint16_t fromPort = 0;
+    ASSERT_EQ(ReceiveDatagram(rx.handle, buf, sizeof buf, &from, &fromPort, 1000), 4);
+    EXPECT_EQ(from, kLoopback);
+    EXPECT_EQ(fromPort, txPort);
+    EXPECT_EQ(std::string(buf, 4), std::string(payload, 4));
+}
+
+TEST(ReceiveDatagram, DatagramLongerThanTheBufferIsAnError) {
+    uint16_t rxPort = 0;
+    Socket rx(CreateUdpSocket(kLoopback, &rxPort));
+    Socket tx(CreateUdpSocket(kLoopback, nullptr));
+    const std::string big(100, 'b');
+    SendDatagram(tx.handle, big.data(), big.size(), kLoopback, rxPort);
+    char buf[10];
+    uint32_t from = 0;
+    uint16_t fromPort = 0;
+    EXPECT_EQ(ReceiveDatagram(rx.handle, buf, sizeof buf, &from, &fromPort, 1000),
+              platform::kSocketError);
+    EXPECT_EQ(platform::LastSocketError(), platform::kErrMessageSize);
+    EXPECT_EQ(fromPort, 0);
+}
+
+TEST(NetworkEndpoint, TextCarriesBothLabelsEvenWhenTheAddressIsEmpty) {
+    EXPECT_EQ(foundation::NetworkEndpoint("192.0.2.10", 5062).ToString(),
+              "m_address= 192.0.2.10, m_port=5062");
+    EXPECT_EQ(foundation::NetworkEndpoint("", -1).ToString(), "m_address= , m_port=-1");
+}
+
+TEST(UdpSocket, ClosedObjectReturnsAtOnceAndRefusesToSend) {
+    foundation::UdpSocket s;
+    std::string from = "unchanged";
+    uint16_t port = 7;
+    const uint64_t start = platform::GetTickCount64();
+    EXPECT_EQ(s.Receive(from, port), "");
+    EXPECT_LT(platform::GetTickCount64() - start, 100u);
+    EXPECT_EQ(from, "unchanged");
+    EXPECT_EQ(port, 7);
+    EXPECT_FALSE(s.SendTo("x", kLoopback, 9));
+    EXPECT_EQ(s.LocalAddress(), kAddressNone);
+    EXPECT_EQ(s.LocalAddressText(), "");
+}
+
+TEST(UdpSocket, RoundTripKeepsZeroBytesAndReportsTheEndpoints) {
+    foundation::UdpSocket rx;
+    ASSERT_TRUE(rx.Open("127.0.0.1", 0, 0, false));
+    EXPECT_NE(rx.LocalPort(), 0);
+    EXPECT_EQ(rx.LocalAddressText(), "127.0.0.1");
+    EXPECT_EQ(rx.LocalEndpointText(), "127.0.0.1:" + std::to_string(rx.LocalPort()));
+    foundation::UdpSocket tx;
+    ASSERT_TRUE(tx.Open());
+    const std::string payload("a\0b\0", 4);
+    ASSERT_TRUE(tx.SendTo(payload, "localhost", rx.LocalPort()));
+    std::string from;
+    uint16_t fromPort = 0;
+    EXPECT_EQ(rx.Receive(from, fromPort), payload);
+    EXPECT_EQ(from, "127.0.0.1");
+    EXPECT_EQ(fromPort, tx.LocalPort());
+    rx.Close();
+    EXPECT_EQ(rx.LocalPort(), 0);
+    EXPECT_FALSE(rx.IsValid());
+}
+
+TEST(UdpSocket, ExactPortIsTheOnlyOneTried) {
+    foundation::UdpSocket a;
+    ASSERT_TRUE(a.Open("127.0.0.1", 0, 0, false));
+    foundation::UdpSocket b;
+    EXPECT_FALSE(b.Open("127.0.0.1", a.LocalPort()));
+    EXPECT_FALSE(b.IsValid());
+}
+
+// Adapters as a test double describes them.
+class FakeNetworkInfo : public platform::NetworkInfo {
+  public:
+    bool Adapters(std::vector<platform::AdapterInfo>& out) override {
+        out = adapters;
+        return ok;
+    }
+    bool AddressTable(std::vector<platform::AddressRow>& out) override {
+        out.clear();
+        return ok;
+    }
+    int UdpInDatagrams(uint32_t& count) override {
+        count = 42;
+        return udpError;
+    }
+    std::vector<platform::AdapterInfo> adapters;
+    bool ok = true;
+    int udpError = 0;
+};
+
+class AdapterQueries : public ::testing::Test {
+  protected:
+    void SetUp() override { platform::InstallNetworkInfo(&fake); }
+    void TearDown() override { platform::InstallNetworkInfo(nullptr); }
+    FakeNetworkInfo fake;
+};
+
+TEST_F(AdapterQueries, GatewayComesFromTheFirstAdapterWhosePrimaryAddressMatches) {
+    fake.adapters = {{1, "lo", {"127.0.0.1"}, ""},
+                     {2, "eth0", {"10.0.0.2", "10.0.0.3"}, "10.0.0.1"},
+                     {3, "eth1", {"10.0.0.3"}, "10.0.0.254"},
+                     {4, "eth2", {"192.0.2.5"}, ""}};
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.2"), "10.0.0.1");
+    // A secondary address does not count; the adapter where it is primary does.
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.3"), "10.0.0.254");
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("192.0.2.5"), "");
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.02"), "");  // byte-wise comparison
+    fake.ok = false;
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.2"), "");
+}
+
+TEST_F(AdapterQueries, InterfaceAddressAndGatewayNeedBothIndexAndGateway) {
+    fake.adapters = {{4, "eth2", {"192.0.2.5"}, ""}, {7, "eth0", {"10.0.0.2"}, "10.0.0.1"}};
+    std::string address = "x";
+    std::string gateway = "y";
+    EXPECT_FALSE(foundation::GetInterfaceAddressAndGateway(4, address, gateway));
+    EXPECT_EQ(address, "x");
+    ASSERT_TRUE(foundation::GetInterfaceAddressAndGateway(7, address, gateway));
+    EXPECT_EQ(address, "10.0.0.2");
+    EXPECT_EQ(gateway, "10.0.0.1");
+}
+
+TEST_F(AdapterQueries, UdpCounterErrorBecomesAWin32Result) {
+    uint32_t count = 0;
+    EXPECT_EQ(foundation::QueryUdpInDatagrams(&count), 0);
+    EXPECT_EQ(count, 42u);
+    fake.udpError = 0x12345;
+    count = 7;
+    EXPECT_EQ(static_cast<uint32_t>(foundation::QueryUdpInDatagrams(&count)), 0x80072345u);
+    EXPECT_EQ(count, 7u);
+}
+
+TEST(UdpInDatagrams, SystemCounterGrowsWhenADatagramArrives) {
+    uint32_t before = 0;
+    ASSERT_EQ(foundation::QueryUdpInDatagrams(&before), 0);
+    uint16_t rxPort = 0;
+    Socket rx(CreateUdpSocket(kLoopback, &rxPort));
+    Socket tx(CreateUdpSocket(kLoopback, nullptr));
+    SendDatagram(tx.handle, "x", 1, kLoopback, rxPort);
+    char buf[4];
+    ASSERT_EQ(ReceiveDatagram(rx.handle, buf, sizeof buf, nullptr, nullptr, 1000), 1);
+    uint32_t after = 0;
+    ASSERT_EQ(foundation::QueryUdpInDatagrams(&after), 0);
+    EXPECT_GT(after, before);
+}
+
+TEST(SystemNetworkInfo, LoopbackIsListedWithoutAGateway) {
+    std::vector<platform::AdapterInfo> adapters;
+    ASSERT_TRUE(platform::SystemNetworkInfo().Adapters(adapters));
+    bool sawLoopback = false;
+    for (const auto& a : adapters) {
+        if (!a.addresses.empty() && a.addresses.front() == "127.0.0.1") {
+            sawLoopback = true;
+            EXPECT_EQ(a.gateway, "");
+            EXPECT_NE(a.index, 0u);
+        }
+    }
+    EXPECT_TRUE(sawLoopback);
+}
+
+}  // namespace

@@ -1,0 +1,81 @@
+// nqpm classify: the NAT type in front of a local address, as the port manager learns it.
+#include <cstdio>
+
+#include "foundation/NetUtils.h"
+#include "stun/STUNClassify.h"
+#include "stun/STUNResults.h"
+#include "tools/nqpm/Cli.h"
+#include "tools/nqpm/Commands.h"
+
+namespace nqpm {
+
+namespace {
+
+const char* const kUsage =
+    "usage: nqpm classify --stun LIST --local A.B.C.D [--json]\n"
+    "Classifies the path from the local address to the Internet with the classic STUN tests\n"
+    "(RFC 3489) against the first answering server of LIST (comma-separated host names or\n"
+    "dotted quads, port 3478). Takes up to about 20 s. Exit 0 whenever a result was obtained.\n";
+
+}  // namespace
+
+std::string ClassificationJson(const stun::STUNResultList& list) {
+    std::vector<std::string> results;
+    for (int32_t i = 0; i < list.count && i < static_cast<int32_t>(stun::kMaxSTUNResults); ++i) {
+        const auto& e = list.entries[i];
+        JsonObject o;
+        o.Add("local", stun::FormatHostOrderAddress(e.localAddress));
+        const char* name = stun::STUNResultName(e.stunResult);
+        o.Add("result", name != nullptr ? name : "invalid");
+        o.Add("code", static_cast<int64_t>(e.stunResult));
+        if (e.publicAddress == stun::kNoPublicAddress) {
+            o.AddNull("public");
+        } else {
+            o.Add("public", stun::FormatHostOrderAddress(e.publicAddress));
+        }
+        results.push_back(o.Str());
+    }
+    JsonObject top;
+    top.AddRaw("results", JsonArray(results));
+    top.Add("text", stun::FormatSTUNResults(list));
+    return top.Str();
+}
+
+int RunClassify(int argc, char** argv) {
+    Options options("classify", {{"stun", true}, {"local", true}}, kUsage);
+    options.Parse(argc, argv);
+    if (options.WantsHelp()) {
+        std::fputs(kUsage, stdout);
+        return kExitOk;
+    }
+    const std::string servers = options.Required("stun");
+    const uint32_t local = ParseDottedQuad("local", options.Required("local"));
+    ConfigureLogging(options);
+
+    Progress("looking for an answering STUN server");
+    int32_t index = stun::STUN_TestServers(local, servers.c_str());
+    if (index < 0) {
+        index = 0;  // no server answered: classify against the first, which ends as blocked
+    }
+    char token[stun::kServerTokenSize];
+    stun::GetListToken(servers.c_str(), index, token, sizeof token);
+    uint32_t server = 0;
+    if (!stun::ResolveSTUNServer(token, true, server)) {
+        std::fprintf(stderr, "nqpm classify: cannot resolve STUN server '%s'\n", token);
+        return kExitFailed;
+    }
+    Progress(std::string("classifying against ") + token + " (up to about 20 s)");
+    stun::STUNResultList list;
+    list.count = 1;
+    list.entries[0].localAddress = local;
+    stun::STUN_GetResult(server, stun::kSTUNPort, list.entries[0]);
+
+    if (options.Json()) {
+        std::printf("%s\n", ClassificationJson(list).c_str());
+    } else {
+        std::printf("%s\n", stun::FormatSTUNResults(list).c_str());
+    }
+    return kExitOk;
+}
+
+}  // namespace nqpm

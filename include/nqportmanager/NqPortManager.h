@@ -1,0 +1,152 @@
+// NqPortManager: NAT traversal for SIP voice and video clients.
+//
+// The interfaces are those of the COM in-process server: abstract classes whose vtables follow
+// COM's order (QueryInterface, AddRef, Release, then the members in order), so client code reads
+// the same on every platform. Strings are BSTRs, booleans VARIANT_BOOL, results HRESULTs.
+//
+// Threads: create the objects on one thread and call them only from it. That thread must pump its
+// message queue (platform::RunMessageLoop, or platform::PumpPendingMessages whenever
+// platform::MessageQueueDescriptor() is readable): discovery outcomes, keep-alive timers and
+// events all arrive through it, and events are fired on it.
+#pragma once
+
+#include <nqportmanager/com.h>
+
+enum PM_STATE : int32_t {
+    PMS_UNINITIALIZED = 0,
+    PMS_INITIALIZING = 1,
+    PMS_COMPLETED = 2,
+};
+
+enum PM_TOPOLOGY : int32_t {
+    PMT_UNKNOWN = 0,
+    PMT_STUN_OPEN = 1,
+    PMT_STUN_FULL_CONE_FIREWALL = 2,
+    PMT_STUN_FULL_CONE_NAT = 3,
+    PMT_STUN_RESTRICTED_CONE_NAT = 4,
+    PMT_STUN_PORT_RESTRICTED_CONE_NAT = 5,
+    PMT_STUN_SYMMETRIC_FIREWALL = 6,
+    PMT_STUN_SYMMETRIC_NAT = 7,
+    PMT_STUN_BLOCKED = 8,
+    PMT_UPNP_ENABLED_NAT_OR_FIREWALL = 9,
+};
+
+enum PM_EVENT : int32_t {
+    PME_UPDATED = 0,
+    PME_SHUTDOWN = 1,
+    PME_NETWORK_CHANGE = 2,
+    PME_DIAGNOSTIC_COMPLETED = 3,
+};
+
+// The type argument of IPortMappingProvider::GetMapping.
+enum PortMappingType : int32_t {
+    AudioRTP = 0,
+    AudioRTCP = 1,
+    VideoRTP = 2,
+    VideoRTCP = 3,
+    SIP = 4,
+};
+
+inline constexpr GUID LIBID_NqPortManagerLib = MakeGuid("AB2DF447-AB6E-4B85-A711-1B18EB6F9373");
+inline constexpr CLSID CLSID_AdvancedPortManager = MakeGuid("28156084-AE26-4971-83A0-74567B29AD24");
+inline constexpr CLSID CLSID_LocalSipProxy = MakeGuid("85E7C75C-49D7-4971-8751-90CC1666D14E");
+inline constexpr CLSID CLSID_PortManagerUpdateEvent =
+    MakeGuid("120F301B-3AF2-41FE-B21A-FADD511464B9");
+inline constexpr CLSID CLSID_NetworkDiagnosticEvent =
+    MakeGuid("790E48F3-CBA4-4EB2-AAD8-E19C06C39FD7");
+inline constexpr IID IID_IAdvancedPortManager = MakeGuid("67BB31D3-5F3B-469E-B719-AE5223EDC5D5");
+inline constexpr IID IID_INqDiagnostics = MakeGuid("0991CB11-334B-4B2C-B19E-A5DC2F7645DB");
+inline constexpr IID DIID__IAdvancedPortManagerEvents =
+    MakeGuid("0AFB8C5E-1C4A-4BB9-BF51-7A872822DBDE");
+inline constexpr IID IID_IPortManagerUpdateEvent = MakeGuid("EE9A8A46-776D-4C9F-B7B1-E201B044A9CC");
+inline constexpr IID IID_INetworkDiagnosticEvent = MakeGuid("827A1D3A-73BE-45EE-AC32-A5C5707C4D87");
+inline constexpr IID IID_ILocalSipProxy = MakeGuid("B9CF6437-54BC-41D7-9F91-4E4CD48CC0DF");
+// The port-mapping interface answers under two ids that share one implementation.
+inline constexpr IID IID_IPortMappingProvider = MakeGuid("24C284AB-8AEC-462A-B740-0756B3A33D5B");
+inline constexpr IID IID_IPortMappingProvider2 = MakeGuid("23D7AA83-0D64-4643-BAC1-5894837451ED");
+inline constexpr GUID APPID_NqPortManager = MakeGuid("EF9E4928-571F-4C6A-86C4-1D4EA4814393");
+
+struct IAdvancedPortManager : public IDispatch {
+    virtual HRESULT Shutdown() = 0;
+    virtual HRESULT InitializeEx(BSTR bstrStunServerName, LONG lStartingPort, LONG lNumberOfPorts,
+                                 BSTR bstrSipProxy, BSTR bstrMediaProxy,
+                                 VARIANT_BOOL vbForceUpnpDisabled,
+                                 VARIANT_BOOL vbForceStunDisabled) = 0;
+    virtual HRESULT get_StunServer(BSTR* pVal) = 0;
+    virtual HRESULT get_StartingPort(LONG* pVal) = 0;
+    virtual HRESULT get_NumberOfPorts(LONG* pVal) = 0;
+    virtual HRESULT get_State(PM_STATE* pVal) = 0;
+    virtual HRESULT get_Topology(PM_TOPOLOGY* pVal) = 0;
+    virtual HRESULT InitiateShutdown() = 0;
+    virtual HRESULT get_RecommendedPortManager(IUnknown** pVal) = 0;
+    virtual HRESULT get_RecommendedSipServer(BSTR* pVal) = 0;
+    virtual HRESULT get_RecommendedUpnpEnabled(VARIANT_BOOL* pVal) = 0;
+    virtual HRESULT OnBeforeEnableProfile(VARIANT networkAddresses, LONG minSipPort,
+                                          LONG maxSipPort, LONG minAudioRTPPort,
+                                          LONG maxAudioRTPPort, LONG minAudioRTCPPort,
+                                          LONG maxAudioRTCPPort, LONG minVideoRTPPort,
+                                          LONG maxVideoRTPPort, LONG minVideoRTCPPort,
+                                          LONG maxVideoRTCPPort, LONG portsPerProtocol) = 0;
+    virtual HRESULT OnBeforeDisableProfile() = 0;
+    virtual HRESULT InitializeEx2(BSTR bstrStunServerName, LONG lStartingPort, LONG lNumberOfPorts,
+                                  BSTR bstrSipProxy, BSTR bstrMediaProxy,
+                                  VARIANT_BOOL vbForceUpnpDisabled,
+                                  VARIANT_BOOL vbForceStunDisabled, LONG lRefreshInterval,
+                                  VARIANT_BOOL vbRefreshAudio, VARIANT_BOOL vbRefreshVideo,
+                                  VARIANT_BOOL vbRefreshSIP) = 0;
+    virtual HRESULT get_ClientNameSuffix(BSTR* pVal) = 0;
+    virtual HRESULT get_PrivateIpAddress(BSTR* pVal) = 0;
+    virtual HRESULT get_PublicIpAddress(BSTR* pVal) = 0;
+    virtual HRESULT Refresh() = 0;
+    // networkAddresses: a VARIANT of type VT_ARRAY | VT_BSTR, one "address[:port]" per element.
+    virtual HRESULT OnBeforeEnableProfileEx(VARIANT networkAddresses, LONG minPort, LONG maxPort,
+                                            LONG portsPerProtocol, VARIANT_BOOL randomizePorts) = 0;
+    virtual HRESULT DiagnoseNetwork(BSTR bstrWellKnownNetworkAddress, BSTR bstrStunServer,
+                                    BSTR bstrEchoServer, INT nEchoServerPort, LONG timeout,
+                                    LONG cookie) = 0;
+    virtual HRESULT get_UDPPacketsIn(LONG* pVal) = 0;
+    virtual HRESULT ErrorCanBeDiagnosed(LONG errorCode, VARIANT_BOOL* pVal) = 0;
+};
+
+// The logger that every object of the process shares.
+struct INqDiagnostics : public IUnknown {
+    virtual HRESULT get_LogLevel(INT* pLevel) = 0;
+    virtual HRESULT put_LogLevel(INT level) = 0;
+    virtual HRESULT get_LogFolder(BSTR* pbstrFolder) = 0;
+    virtual HRESULT get_LogFilePrefix(BSTR* pbstrPrefix) = 0;
+    virtual HRESULT get_LogFileExtension(BSTR* pbstrExtension) = 0;
+    virtual HRESULT get_LoggingEnabled(VARIANT_BOOL* pbEnabled) = 0;
+    virtual HRESULT put_LoggingEnabled(VARIANT_BOOL enabled) = 0;
+    virtual HRESULT InitializeLogging(BSTR bstrFolder, BSTR bstrPrefix, BSTR bstrExt, INT LogLevel,
+                                      VARIANT_BOOL enabled) = 0;
+    virtual HRESULT ShutdownLogging() = 0;
+};
+
+// The client's sink: connect it to the port manager's connection point for
+// DIID__IAdvancedPortManagerEvents. Event is called synchronously on the client's thread.
+struct _IAdvancedPortManagerEvents : public IUnknown {
+    virtual HRESULT Event(PM_EVENT EventType, IDispatch* pEvent) = 0;
+};
+
+// Travels with PME_UPDATED and PME_NETWORK_CHANGE; names the port manager that fired it.
+struct IPortManagerUpdateEvent : public IDispatch {
+    virtual HRESULT get_PortManager(IAdvancedPortManager** pVal) = 0;
+    virtual HRESULT put_PortManager(IAdvancedPortManager* newVal) = 0;
+};
+
+// Port mappings of the port manager (query it from IAdvancedPortManager).
+struct IPortMappingProvider : public IUnknown {
+    // type: a PortMappingType. Returned BSTRs belong to the caller.
+    virtual HRESULT GetMapping(BSTR address, LONG type, BSTR* privateAddress, LONG* privatePort,
+                               BSTR* publicAddress, LONG* publicPort) = 0;
+    virtual HRESULT UpdateRemoteAddress(LONG a, LONG b, LONG c, LONG d, LONG e) = 0;
+    virtual HRESULT ReleaseMapping(BSTR privateAddress, LONG privatePort, BSTR publicAddress,
+                                   LONG publicPort) = 0;
+    // Registers the remote endpoint of a media mapping: its keep-alives go there until
+    // ReleaseMapping. On Linux the keep-alive is sent from the mapping's own private port, which
+    // works while your media socket is bound there only if that socket set SO_REUSEADDR before
+    // binding (Linux lets two sockets share a UDP port only when both allow it).
+    virtual HRESULT UpdateRemoteAddressEx(BSTR remoteAddress, LONG remotePort, BSTR privateAddress,
+                                          LONG privatePort, BSTR publicAddress,
+                                          LONG publicPort) = 0;
+};

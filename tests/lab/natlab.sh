@@ -110,7 +110,7 @@ teardown() {
     done
     for ns in "$name-cli" "$name-nat" "$name-srv"; do
         ns_exists "$ns" || continue
-        ip netns del "$ns" 2>/dev/null || ip netns del "$ns"
+        ip netns del "$ns"
     done
     rm -rf "$dir"
 }
@@ -121,7 +121,6 @@ spawn() {
     local ns=$1 log=$2 pidfile=$3; shift 3
     setsid ip netns exec "$ns" "$@" </dev/null >"$log" 2>&1 9>&- &
     local pid=$!
-    sleep 0.05
     echo "$pid $(proc_start "$pid")" >"$pidfile"
     SPAWNED=$pid
 }
@@ -323,8 +322,8 @@ cmd_up() {
 
     teardown "$name"
     UP_DONE=0
-    # shellcheck disable=SC2154
-    trap 'rc=$?; if [[ $UP_DONE != 1 ]]; then teardown "'"$name"'" >/dev/null 2>&1 || true; ((rc == 0)) && rc=1; fi; exit $rc' EXIT
+    # Any failure (ip exits 2 too) leaves nothing behind and reports 1.
+    trap 'if [[ $UP_DONE != 1 ]]; then teardown "'"$name"'" >/dev/null 2>&1 || true; exit 1; fi' EXIT
     trap 'echo "$PROG: failed at line $LINENO: $BASH_COMMAND" >&2' ERR
     trap 'exit 1' INT TERM HUP
     mkdir -p "$dir"
@@ -395,6 +394,7 @@ cmd_down() {
     check_name "$1"
     need_root
     take_lock
+    trap '(($? == 0)) || exit 1' EXIT
     teardown "$1"
 }
 

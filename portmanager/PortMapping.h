@@ -3,8 +3,8 @@
 // binding open.
 #pragma once
 
-#include <list>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "foundation/NetUtils.h"

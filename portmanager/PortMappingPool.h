@@ -10,7 +10,7 @@
 namespace portmanager {
 
 class PortMappingPool {
-public:
+  public:
     PortMappingPool() = default;
     ~PortMappingPool() = default;  // the owner closes the free list explicitly (CloseFree)
     PortMappingPool(const PortMappingPool&) = delete;
@@ -19,10 +19,10 @@ public:
     // Replaces the free list with mappings of the parity from [minPort, maxPort): first up to 100
     // random candidates when randomize, then an ascending scan. True as soon as the free list
     // holds count mappings (tested after each addition); false when the ports run out, keeping
-    // what was found.
+    // what was found. Candidates outside 1..65535 are skipped without a bind: they can never be
+    // held as themselves.
     bool Fill(bool even, uint32_t count, int32_t minPort, int32_t maxPort,
-              const std::string& privateAddress, const std::string& publicAddress,
-              bool randomize);
+              const std::string& privateAddress, const std::string& publicAddress, bool randomize);
     // Hands out the front of the free list, its port released for the client to bind. False
     // when the free list is empty.
     bool GetMapping(MappedServiceEndpoint& mapping);
@@ -35,9 +35,8 @@ public:
     const std::deque<MappedServiceEndpoint>& Free() const { return m_free; }
     const std::deque<MappedServiceEndpoint>& InUse() const { return m_inUse; }
 
-private:
-    bool TryAdd(int32_t port, const std::string& privateAddress,
-                const std::string& publicAddress);
+  private:
+    bool TryAdd(int32_t port, const std::string& privateAddress, const std::string& publicAddress);
 
     std::deque<MappedServiceEndpoint> m_inUse;
     std::deque<MappedServiceEndpoint> m_free;

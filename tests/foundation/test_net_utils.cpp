@@ -11,6 +11,7 @@
 #include "platform/kernel.h"
 #include "platform/net.h"
 #include "platform/netinfo.h"
+#include "tests/support/FakeNetworkInfo.h"
 
 namespace {
 
@@ -203,31 +204,9 @@ TEST(UdpSocket, ExactPortIsTheOnlyOneTried) {
     EXPECT_FALSE(b.IsValid());
 }
 
-// Adapters as a test double describes them.
-class FakeNetworkInfo : public platform::NetworkInfo {
-  public:
-    bool Adapters(std::vector<platform::AdapterInfo>& out) override {
-        out = adapters;
-        return ok;
-    }
-    bool AddressTable(std::vector<platform::AddressRow>& out) override {
-        out.clear();
-        return ok;
-    }
-    int UdpInDatagrams(uint32_t& count) override {
-        count = 42;
-        return udpError;
-    }
-    std::vector<platform::AdapterInfo> adapters;
-    bool ok = true;
-    int udpError = 0;
-};
-
 class AdapterQueries : public ::testing::Test {
   protected:
-    void SetUp() override { platform::InstallNetworkInfo(&fake); }
-    void TearDown() override { platform::InstallNetworkInfo(nullptr); }
-    FakeNetworkInfo fake;
+    testsupport::FakeNetworkInfo fake;
 };
 
 TEST_F(AdapterQueries, GatewayComesFromTheFirstAdapterWhosePrimaryAddressMatches) {

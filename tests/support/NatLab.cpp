@@ -19,9 +19,12 @@ bool NatLab::CanRun() {
 }
 
 std::string NatLab::UniqueName(int tag) {
-    // Six characters: two for the tag, four from the pid.
-    const int pid = platform::testing::CurrentProcessId() % 10000;
-    std::string name = "l" + std::to_string(tag % 10) + std::to_string(pid);
+    // One character for the tag, up to five for the pid in base 36 (pids stay below 36^5).
+    const char* digits = "0123456789abcdefghijklmnopqrstuvwxyz";
+    std::string name(1, digits[tag % 36]);
+    for (int pid = platform::testing::CurrentProcessId(); pid > 0; pid /= 36) {
+        name += digits[pid % 36];
+    }
     return name.substr(0, 6);
 }
 

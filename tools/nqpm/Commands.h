@@ -9,6 +9,9 @@ namespace nqpm {
 
 int RunBinding(int argc, char** argv);
 int RunClassify(int argc, char** argv);
+int RunDiscover(int argc, char** argv);
+int RunProfile(int argc, char** argv);
+int RunMonitor(int argc, char** argv);
 
 // {"results":[{"local":..,"result":..,"code":..,"public":..|null}],"text":..}
 std::string ClassificationJson(const stun::STUNResultList& list);

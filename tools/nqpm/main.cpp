@@ -18,6 +18,9 @@ struct Command {
 const Command kCommands[] = {
     {"binding", nqpm::RunBinding, "one STUN Binding transaction against a server"},
     {"classify", nqpm::RunClassify, "the NAT type in front of a local address"},
+    {"discover", nqpm::RunDiscover, "topology and recommendations of a port manager"},
+    {"profile", nqpm::RunProfile, "enable a profile and hand out port mappings"},
+    {"monitor", nqpm::RunMonitor, "local addresses, then every address or route change"},
 };
 
 void PrintUsage(std::FILE* out) {

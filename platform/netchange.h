@@ -1,0 +1,39 @@
+// Notifications of IPv4 address and routing table changes, as a descriptor the caller waits on
+// (with platform::WaitReadable, so that the owner's stop request wakes it too).
+#pragma once
+
+#include <cstddef>
+
+namespace platform {
+
+// What arrived since the last read; the two kinds are served separately by the callers.
+struct NetworkChanges {
+    bool addresses = false;  // an IPv4 address was added or removed
+    bool routes = false;     // an IPv4 route was added or removed
+};
+
+// Subscribes to the kernel's IPv4 address and route notifications at construction and owns
+// the socket that receives them.
+class NetworkChangeWatcher {
+  public:
+    NetworkChangeWatcher();
+    ~NetworkChangeWatcher();
+    NetworkChangeWatcher(const NetworkChangeWatcher&) = delete;
+    NetworkChangeWatcher& operator=(const NetworkChangeWatcher&) = delete;
+
+    bool IsOpen() const { return fd_ >= 0; }
+    // Readable while notifications are queued; -1 when not open.
+    int Descriptor() const { return fd_; }
+    // Reads every queued notification without blocking. When the kernel had to drop some (the
+    // receive buffer overflowed), both kinds are reported, since either may have been lost.
+    NetworkChanges Read();
+
+  private:
+    int fd_;
+};
+
+// The kinds named by a datagram of the kernel's route notifications. Stops at the first header
+// that does not fit in the remaining bytes; anything after it is ignored.
+NetworkChanges ParseNetworkChanges(const void* data, size_t length);
+
+}  // namespace platform

@@ -1,0 +1,203 @@
+// The port manager the client creates and drives: discovery of the path to the Internet (UPnP
+// gateway or STUN classification, in the background), the resulting recommendations, port
+// mappings with keep-alives, and events to the client's sinks.
+#pragma once
+
+#include <atomic>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include <nqportmanager/NqPortManager.h>
+
+#include "foundation/NetworkChangeMonitor.h"
+#include "platform/message.h"
+#include "portmanager/ConnectionPoint.h"
+#include "portmanager/Dispatch.h"
+#include "portmanager/PortMapping.h"
+#include "portmanager/PortMappingPool.h"
+#include "portmanager/UpnpDetector.h"
+#include "stun/STUNResult.h"
+
+namespace portmanager {
+
+inline constexpr platform::UINT WM_PM_STUN_REFRESH = platform::WM_USER + 123;
+inline constexpr platform::UINT WM_PM_UPNP_DETECTED = platform::WM_USER + 124;
+inline constexpr platform::UINT WM_PM_NETWORK_CHANGE = platform::WM_USER + 125;
+inline constexpr platform::UINT WM_PM_DIAGNOSTIC_COMPLETE = platform::WM_USER + 126;
+inline constexpr uintptr_t REFRESH_TIMER_ID = 1234;
+inline constexpr uintptr_t SHUTDOWN_TIMER_ID = 1000;
+inline constexpr uint32_t kShutdownTimerPeriodMs = 1000;
+inline constexpr uint32_t kKeepAlivePeriodMs = 30000;
+inline constexpr uint32_t kEarlyKeepAliveMs = 200;
+
+// What the port manager builds on, replaceable where a test must control the answers.
+struct PortManagerServices {
+    std::function<std::unique_ptr<stun::ISTUNResult>(const char* servers, platform::WindowHandle,
+                                                     platform::UINT, platform::WPARAM)>
+        createStunService;
+
+    static PortManagerServices Default();
+};
+
+class CAdvancedPortManager final : public ISupportErrorInfo,
+                                   public IConnectionPointContainer,
+                                   public IConnectionPoint,
+                                   public NoTypeInfoDispatch<IAdvancedPortManager>,
+                                   public IPortMappingProvider,
+                                   public platform::MessageWindow,
+                                   public INqDiagnostics,
+                                   public foundation::INetworkChangeSink {
+  public:
+    // Creates the object (hidden window included) on the calling thread and returns the asked
+    // interface. E_FAIL when the window cannot be created.
+    static HRESULT CreateInstance(REFIID riid, void** ppv,
+                                  PortManagerServices services = PortManagerServices::Default());
+
+    // IUnknown
+    HRESULT QueryInterface(REFIID riid, void** ppv) override;
+    ULONG AddRef() override;
+    ULONG Release() override;
+
+    // ISupportErrorInfo
+    HRESULT InterfaceSupportsErrorInfo(REFIID riid) override;
+
+    // IConnectionPointContainer
+    HRESULT EnumConnectionPoints(IEnumConnectionPoints** ppEnum) override;
+    HRESULT FindConnectionPoint(REFIID riid, IConnectionPoint** ppCP) override;
+
+    // IConnectionPoint (for _IAdvancedPortManagerEvents)
+    HRESULT GetConnectionInterface(IID* pIID) override;
+    HRESULT GetConnectionPointContainer(IConnectionPointContainer** ppCPC) override;
+    HRESULT Advise(IUnknown* pUnkSink, DWORD* pdwCookie) override;
+    HRESULT Unadvise(DWORD dwCookie) override;
+    HRESULT EnumConnections(IEnumConnections** ppEnum) override;
+
+    // IAdvancedPortManager
+    HRESULT Shutdown() override;
+    HRESULT InitializeEx(BSTR bstrStunServerName, LONG lStartingPort, LONG lNumberOfPorts,
+                         BSTR bstrSipProxy, BSTR bstrMediaProxy, VARIANT_BOOL vbForceUpnpDisabled,
+                         VARIANT_BOOL vbForceStunDisabled) override;
+    HRESULT get_StunServer(BSTR* pVal) override;
+    HRESULT get_StartingPort(LONG* pVal) override;
+    HRESULT get_NumberOfPorts(LONG* pVal) override;
+    HRESULT get_State(PM_STATE* pVal) override;
+    HRESULT get_Topology(PM_TOPOLOGY* pVal) override;
+    HRESULT InitiateShutdown() override;
+    HRESULT get_RecommendedPortManager(IUnknown** pVal) override;
+    HRESULT get_RecommendedSipServer(BSTR* pVal) override;
+    HRESULT get_RecommendedUpnpEnabled(VARIANT_BOOL* pVal) override;
+    HRESULT OnBeforeEnableProfile(VARIANT networkAddresses, LONG minSipPort, LONG maxSipPort,
+                                  LONG minAudioRTPPort, LONG maxAudioRTPPort, LONG minAudioRTCPPort,
+                                  LONG maxAudioRTCPPort, LONG minVideoRTPPort, LONG maxVideoRTPPort,
+                                  LONG minVideoRTCPPort, LONG maxVideoRTCPPort,
+                                  LONG portsPerProtocol) override;
+    HRESULT OnBeforeDisableProfile() override;
+    HRESULT InitializeEx2(BSTR bstrStunServerName, LONG lStartingPort, LONG lNumberOfPorts,
+                          BSTR bstrSipProxy, BSTR bstrMediaProxy, VARIANT_BOOL vbForceUpnpDisabled,
+                          VARIANT_BOOL vbForceStunDisabled, LONG lRefreshInterval,
+                          VARIANT_BOOL vbRefreshAudio, VARIANT_BOOL vbRefreshVideo,
+                          VARIANT_BOOL vbRefreshSIP) override;
+    HRESULT get_ClientNameSuffix(BSTR* pVal) override;
+    HRESULT get_PrivateIpAddress(BSTR* pVal) override;
+    HRESULT get_PublicIpAddress(BSTR* pVal) override;
+    HRESULT Refresh() override;
+    HRESULT OnBeforeEnableProfileEx(VARIANT networkAddresses, LONG minPort, LONG maxPort,
+                                    LONG portsPerProtocol, VARIANT_BOOL randomizePorts) override;
+    HRESULT DiagnoseNetwork(BSTR bstrWellKnownNetworkAddress, BSTR bstrStunServer,
+                            BSTR bstrEchoServer, INT nEchoServerPort, LONG timeout,
+                            LONG cookie) override;
+    HRESULT get_UDPPacketsIn(LONG* pVal) override;
+    HRESULT ErrorCanBeDiagnosed(LONG errorCode, VARIANT_BOOL* pVal) override;
+
+    // IPortMappingProvider
+    HRESULT GetMapping(BSTR address, LONG type, BSTR* privateAddress, LONG* privatePort,
+                       BSTR* publicAddress, LONG* publicPort) override;
+    HRESULT UpdateRemoteAddress(LONG a, LONG b, LONG c, LONG d, LONG e) override;
+    HRESULT ReleaseMapping(BSTR privateAddress, LONG privatePort, BSTR publicAddress,
+                           LONG publicPort) override;
+    HRESULT UpdateRemoteAddressEx(BSTR remoteAddress, LONG remotePort, BSTR privateAddress,
+                                  LONG privatePort, BSTR publicAddress, LONG publicPort) override;
+
+    // INqDiagnostics
+    HRESULT get_LogLevel(INT* pLevel) override;
+    HRESULT put_LogLevel(INT level) override;
+    HRESULT get_LogFolder(BSTR* pbstrFolder) override;
+    HRESULT get_LogFilePrefix(BSTR* pbstrPrefix) override;
+    HRESULT get_LogFileExtension(BSTR* pbstrExtension) override;
+    HRESULT get_LoggingEnabled(VARIANT_BOOL* pbEnabled) override;
+    HRESULT put_LoggingEnabled(VARIANT_BOOL enabled) override;
+    HRESULT InitializeLogging(BSTR bstrFolder, BSTR bstrPrefix, BSTR bstrExt, INT LogLevel,
+                              VARIANT_BOOL enabled) override;
+    HRESULT ShutdownLogging() override;
+
+    // INetworkChangeSink (the monitor's thread)
+    void OnLocalIPsChanged() override;
+    void OnRouteChanged() override;
+
+    // The hidden window
+    platform::LRESULT WindowProc(platform::UINT message, platform::WPARAM wParam,
+                                 platform::LPARAM lParam, bool& handled) override;
+
+  private:
+    explicit CAdvancedPortManager(PortManagerServices services);
+    ~CAdvancedPortManager() override;
+
+    HRESULT FinalConstruct();
+    void FinalRelease();
+    void ResetToDefaults();
+    void ResetRecommendations();
+
+    // Window messages
+    void OnTimer(uintptr_t timerId);
+    void OnUpnpDetected();
+    void OnStunRefresh();
+    void NotifyChange(PM_EVENT type);
+    // Discovery outcomes
+    void RecommendMediaProxy();
+    void ApplyStunAddresses(const stun::STUNResultEntry& entry);
+    void StartStunDiscovery();
+
+    std::atomic<ULONG> m_refs{0};
+    PortManagerServices m_services;
+    EventSinks m_sinks;
+    // A copy of the window handle for the monitor's thread, cleared before the window goes.
+    std::atomic<platform::WindowHandle> m_workerWindow{nullptr};
+
+    std::unique_ptr<stun::ISTUNResult> m_pStunResult;
+    UpnpDetector m_upnpDetector;
+    std::optional<std::string> m_stunServer;
+    LONG m_startingPort = 5004;
+    LONG m_numberOfPorts = 16;
+    PM_STATE m_state = PMS_UNINITIALIZED;
+    PM_TOPOLOGY m_topology = PMT_UNKNOWN;
+    std::string m_sipProxy;
+    std::string m_mediaProxy;
+    std::string m_recommendedSipServer;
+    std::optional<std::string> m_privateIpAddress;
+    std::optional<std::string> m_publicIpAddress;
+    bool m_forceUpnpDisabled = false;
+    bool m_forceStunDisabled = false;
+    bool m_stunAddressesInUse = false;
+    bool m_recommendedUpnpEnabled = false;
+    bool m_discoveryComplete = false;
+    LONG m_refreshInterval = 30000;
+    bool m_refreshAudio = true;
+    bool m_refreshVideo = true;
+    bool m_refreshSIP = true;
+    uintptr_t m_refreshTimerId = 0;
+
+    PortMappingPool m_sparePool;
+    PortMappingPool m_audioRtpPool;
+    PortMappingPool m_audioRtcpPool;
+    PortMappingPool m_videoRtpPool;
+    PortMappingPool m_videoRtcpPool;
+    std::vector<PortMapping> m_mediaMappings;
+    std::vector<PortMapping> m_sipMappings;
+
+    foundation::CNetworkChangeMonitor m_monitor;
+};
+
+}  // namespace portmanager

@@ -1,0 +1,33 @@
+// The object that travels with PME_UPDATED and PME_NETWORK_CHANGE. While it lives, the port
+// manager it names stays alive.
+#pragma once
+
+#include <atomic>
+
+#include <nqportmanager/NqPortManager.h>
+
+#include "portmanager/Dispatch.h"
+
+namespace portmanager {
+
+class PortManagerUpdateEvent final : public NoTypeInfoDispatch<IPortManagerUpdateEvent> {
+  public:
+    // A new event with one reference held by the caller.
+    static HRESULT Create(IPortManagerUpdateEvent** event);
+
+    HRESULT QueryInterface(REFIID riid, void** ppv) override;
+    ULONG AddRef() override;
+    ULONG Release() override;
+
+    HRESULT get_PortManager(IAdvancedPortManager** pVal) override;
+    HRESULT put_PortManager(IAdvancedPortManager* newVal) override;
+
+  private:
+    PortManagerUpdateEvent() = default;
+    ~PortManagerUpdateEvent();
+
+    std::atomic<ULONG> m_refs{0};
+    IUnknown* m_portManager = nullptr;  // owned reference, or null
+};
+
+}  // namespace portmanager

@@ -1,0 +1,233 @@
+// Enabling a calling profile: SIP mappings from the client's addresses, five pools of reserved
+// media ports, the first keep-alives and the keep-alive timer; and the mappings handed out.
+#include <algorithm>
+#include <cstdlib>
+#include <ctime>
+#include <limits>
+
+#include "foundation/Logger.h"
+#include "portmanager/AdvancedPortManager.h"
+#include "portmanager/BstrOut.h"
+
+namespace portmanager {
+
+namespace {
+
+constexpr int32_t kClientDefaultPort = 0;
+constexpr int32_t kSipServerDefaultPort = 5060;
+
+// "address[:port]": split at the first colon; a port that is not a number counts as 0.
+NetworkEndpoint ParseEndpointText(const std::string& text, int32_t defaultPort) {
+    const auto colon = text.find(':');
+    if (colon == std::string::npos) {
+        return NetworkEndpoint(text, defaultPort);
+    }
+    const long port = std::strtol(text.c_str() + colon + 1, nullptr, 10);
+    const long clamped = std::max<long>(std::numeric_limits<int32_t>::min(),
+                                        std::min<long>(port, std::numeric_limits<int32_t>::max()));
+    return NetworkEndpoint(text.substr(0, colon), static_cast<int32_t>(clamped));
+}
+
+// Writes the four out values, or none of them.
+HRESULT WriteMapping(const MappedServiceEndpoint& m, BSTR* privateAddress, LONG* privatePort,
+                     BSTR* publicAddress, LONG* publicPort) {
+    BSTR priv = nullptr;
+    BSTR pub = nullptr;
+    if (FAILED(CopyBstrOut(m.m_private.m_address, &priv))) {
+        return E_OUTOFMEMORY;
+    }
+    if (FAILED(CopyBstrOut(m.m_public.m_address, &pub))) {
+        SysFreeString(priv);
+        return E_OUTOFMEMORY;
+    }
+    *privateAddress = priv;
+    *privatePort = m.m_private.m_port;
+    *publicAddress = pub;
+    *publicPort = m.m_public.m_port;
+    return S_OK;
+}
+
+bool SameEndpoints(const MappedServiceEndpoint& a, const MappedServiceEndpoint& b) {
+    return a.m_public == b.m_public && a.m_private == b.m_private;
+}
+
+}  // namespace
+
+HRESULT CAdvancedPortManager::OnBeforeEnableProfile(VARIANT networkAddresses, LONG minSipPort,
+                                                    LONG maxSipPort, LONG, LONG, LONG, LONG, LONG,
+                                                    LONG, LONG, LONG, LONG portsPerProtocol) {
+    // The audio and video ranges are not used: every pool draws from the SIP range.
+    return OnBeforeEnableProfileEx(networkAddresses, minSipPort, maxSipPort, portsPerProtocol,
+                                   VARIANT_TRUE);
+}
+
+HRESULT CAdvancedPortManager::OnBeforeEnableProfileEx(VARIANT networkAddresses, LONG minPort,
+                                                      LONG maxPort, LONG portsPerProtocol,
+                                                      VARIANT_BOOL randomizePorts) {
+    constexpr const char* kFunction = "CAdvancedPortManager::OnBeforeEnableProfileEx";
+    NQ_TRACE_ENTERED(kFunction);
+    if (m_refreshTimerId != 0) {
+        return E_FAIL;
+    }
+    if (networkAddresses.vt != (VT_ARRAY | VT_BSTR)) {
+        return E_INVALIDARG;
+    }
+    // A negative count would never be reached: the first pool would bind every port of its
+    // parity in the range and keep them.
+    if (portsPerProtocol < 0) {
+        return E_INVALIDARG;
+    }
+    if (!m_discoveryComplete || !m_privateIpAddress || m_privateIpAddress->empty() ||
+        !m_publicIpAddress || m_publicIpAddress->empty()) {
+        return E_FAIL;
+    }
+
+    std::srand(static_cast<unsigned>(std::time(nullptr)));
+    m_sipMappings.clear();
+
+    SAFEARRAY* array = networkAddresses.parray;
+    if (array != nullptr && SafeArrayGetElemsize(array) > 0) {
+        const std::string& privateAddress = *m_privateIpAddress;
+        const NetworkEndpoint server =
+            ParseEndpointText(m_recommendedSipServer, kSipServerDefaultPort);
+        LONG lower = 0;
+        SafeArrayGetLBound(array, 1, &lower);
+        const ULONG count = array->rgsabound[0].cElements;
+        for (ULONG i = 0; i < count; ++i) {
+            LONG index = lower + static_cast<LONG>(i);
+            BSTR element = nullptr;
+            if (FAILED(SafeArrayGetElement(array, &index, &element))) {
+                continue;
+            }
+            const NetworkEndpoint client =
+                ParseEndpointText(Utf8FromBstr(element), kClientDefaultPort);
+            SysFreeString(element);
+            const NetworkEndpoint outside(*m_publicIpAddress, client.m_port);
+            const PortMapping mapping(MappedServiceEndpoint(client, outside), server);
+            if (client.m_address == privateAddress) {
+                NQ_LOG(kFunction, foundation::kLogInfo, "Adding SIP Port Mapping for %s",
+                       mapping.ToString().c_str());
+                m_sipMappings.push_back(mapping);
+            }
+        }
+    } else {
+        NQ_LOG(kFunction, foundation::kLogError, "%s",
+               "Failed Assertion - networkAddresses.vt == (VT_ARRAY|VT_BSTR) && "
+               "networkAddresses.parray->cbElements > 0");
+    }
+    if (m_sipMappings.empty()) {
+        return E_FAIL;
+    }
+
+    const std::string p = m_sipMappings.front().m_local.m_private.m_address;
+    const std::string q = m_sipMappings.front().m_local.m_public.m_address;
+    const auto count = static_cast<uint32_t>(portsPerProtocol);
+    const bool randomize = randomizePorts != VARIANT_FALSE;
+    if (!m_sparePool.Fill(true, count <= 1 ? 2 : count, minPort, maxPort, p, q, randomize) ||
+        !m_audioRtpPool.Fill(true, count, minPort, maxPort, p, q, randomize) ||
+        !m_audioRtcpPool.Fill(false, count, minPort, maxPort, p, q, randomize) ||
+        !m_videoRtpPool.Fill(true, count, minPort, maxPort, p, q, randomize) ||
+        !m_videoRtcpPool.Fill(false, count, minPort, maxPort, p, q, randomize)) {
+        return E_FAIL;
+    }
+    DumpPortMappings("AudioRTP", m_audioRtpPool);
+    DumpPortMappings("AudioRTCP", m_audioRtcpPool);
+    DumpPortMappings("VideoRTP", m_videoRtpPool);
+    DumpPortMappings("VideoRTCP", m_videoRtcpPool);
+    RefreshPortMappings(m_sipMappings);
+    m_refreshTimerId =
+        platform::SetTimer(Handle(), REFRESH_TIMER_ID, static_cast<uint32_t>(m_refreshInterval));
+    return S_OK;
+}
+
+HRESULT CAdvancedPortManager::OnBeforeDisableProfile() {
+    NQ_TRACE_ENTERED("CAdvancedPortManager::OnBeforeDisableProfile");
+    if (m_refreshTimerId != 0) {
+        platform::KillTimer(Handle(), m_refreshTimerId);
+        m_refreshTimerId = 0;
+    }
+    return S_OK;
+}
+
+HRESULT CAdvancedPortManager::GetMapping(BSTR, LONG type, BSTR* privateAddress, LONG* privatePort,
+                                         BSTR* publicAddress, LONG* publicPort) {
+    constexpr const char* kFunction = "CAdvancedPortManager::GetMapping";
+    NQ_TRACE_ENTERED(kFunction);
+    if (privateAddress == nullptr || privatePort == nullptr || publicAddress == nullptr ||
+        publicPort == nullptr) {
+        return E_POINTER;
+    }
+    if (!m_pStunResult) {
+        NQ_LOG(kFunction, foundation::kLogError, "%s", "Failed Assertion - m_pStunResult != NULL");
+        return E_FAIL;
+    }
+    if (type == SIP) {
+        if (m_sipMappings.empty()) {
+            NQ_LOG(kFunction, foundation::kLogError, "%s",
+                   "Failed Assertion - !m_sipMappings.empty()");
+            return E_FAIL;
+        }
+        return WriteMapping(m_sipMappings.front().m_local, privateAddress, privatePort,
+                            publicAddress, publicPort);
+    }
+    PortMappingPool* pools[] = {&m_audioRtpPool, &m_audioRtcpPool, &m_videoRtpPool,
+                                &m_videoRtcpPool};
+    if (type < AudioRTP || type > VideoRTCP) {
+        return S_OK;
+    }
+    PortMappingPool& pool = *pools[type];
+    if (pool.Free().empty()) {
+        NQ_LOG(kFunction, foundation::kLogError, "%s", "Failed Assertion - !m_free.empty()");
+        return E_FAIL;
+    }
+    MappedServiceEndpoint mapping;
+    pool.GetMapping(mapping);
+    const HRESULT hr =
+        WriteMapping(mapping, privateAddress, privatePort, publicAddress, publicPort);
+    if (FAILED(hr)) {
+        pool.ReleaseMapping(mapping);  // nothing reached the caller: keep the port reserved
+    }
+    return hr;
+}
+
+HRESULT CAdvancedPortManager::ReleaseMapping(BSTR privateAddress, LONG privatePort,
+                                             BSTR publicAddress, LONG publicPort) {
+    constexpr const char* kFunction = "CAdvancedPortManager::ReleaseMapping";
+    NQ_TRACE_ENTERED(kFunction);
+    MappedServiceEndpoint m(NetworkEndpoint(Utf8FromBstr(privateAddress), privatePort),
+                            NetworkEndpoint(Utf8FromBstr(publicAddress), publicPort));
+    for (const PortMapping& sip : m_sipMappings) {
+        if (SameEndpoints(sip.m_local, m)) {
+            // SIP mappings live until the next enable.
+            NQ_LOG(kFunction, foundation::kLogError, "MappedServiceEndpoint is SIP - %s",
+                   sip.ToString().c_str());
+            return S_OK;
+        }
+    }
+    const std::string text = m.ToString();
+    const MappedServiceEndpoint original = m;  // the pool's re-bind may change m's ports
+    bool released = false;
+    for (PortMappingPool* pool :
+         {&m_audioRtpPool, &m_audioRtcpPool, &m_videoRtpPool, &m_videoRtcpPool}) {
+        if (pool->IsInUse(m.m_private.m_port)) {
+            pool->ReleaseMapping(m);
+            released = true;
+            break;
+        }
+    }
+    if (!released) {
+        NQ_LOG(kFunction, foundation::kLogError,
+               "MappedServiceEndpoint not found in mapping pool - %s", text.c_str());
+    }
+    for (auto it = m_mediaMappings.begin(); it != m_mediaMappings.end(); ++it) {
+        if (SameEndpoints(it->m_local, original)) {
+            m_mediaMappings.erase(it);
+            return S_OK;
+        }
+    }
+    NQ_LOG(kFunction, foundation::kLogError, "MappedServiceEndpoint not found in media pool - %s",
+           text.c_str());
+    return E_FAIL;
+}
+
+}  // namespace portmanager

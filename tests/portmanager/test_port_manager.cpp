@@ -1,0 +1,579 @@
+#include <gtest/gtest.h>
+
+#include <deque>
+#include <memory>
+#include <string>
+
+#include "foundation/Logger.h"
+#include "platform/message.h"
+#include "platform/upnp.h"
+#include "portmanager/AdvancedPortManager.h"
+#include "portmanager/PortManagerUpdateEvent.h"
+#include "tests/support/FakeNetworkInfo.h"
+#include "tests/support/PortManagerDoubles.h"
+
+namespace {
+
+using testsupport::PortManagerWithFakeStun;
+using testsupport::RecordingSink;
+using testsupport::ToUtf8;
+
+constexpr uint32_t A = 0xC000020A;  // 192.0.2.10
+constexpr uint32_t B = 0xC000020B;  // 192.0.2.11
+constexpr uint32_t P = 0xC6336407;  // 198.51.100.7
+constexpr uint32_t Q = 0xCB007109;  // 203.0.113.9
+
+class FixedUpnpProbe : public platform::UpnpGatewayProbe {
+  public:
+    explicit FixedUpnpProbe(bool present) : present_(present) {
+        platform::InstallUpnpGatewayProbe(this);
+    }
+    ~FixedUpnpProbe() override { platform::InstallUpnpGatewayProbe(nullptr); }
+    bool GatewayPresent() override { return present_; }
+
+  private:
+    bool present_;
+};
+
+// Each test: a port manager with a fake STUN service, a fake network listing 192.0.2.10, and no
+// real UPnP search.
+class PortManager : public ::testing::Test {
+  protected:
+    PortManager() : upnp(false) { net.AddInterface("192.0.2.10", "192.0.2.1"); }
+
+    void PumpUntilEvents(RecordingSink& sink, size_t count) {
+        ASSERT_TRUE(
+            platform::RunMessageLoopUntil([&] { return sink.received.size() >= count; }, 5000));
+    }
+    std::string Private() {
+        BSTR s = nullptr;
+        EXPECT_EQ(H().pm->get_PrivateIpAddress(&s), S_OK);
+        return ToUtf8(s);
+    }
+    std::string Public() {
+        BSTR s = nullptr;
+        EXPECT_EQ(H().pm->get_PublicIpAddress(&s), S_OK);
+        return ToUtf8(s);
+    }
+    std::string SipServer() {
+        BSTR s = nullptr;
+        EXPECT_EQ(H().pm->get_RecommendedSipServer(&s), S_OK);
+        return ToUtf8(s);
+    }
+    std::string Suffix() {
+        BSTR s = nullptr;
+        EXPECT_EQ(H().pm->get_ClientNameSuffix(&s), S_OK);
+        return ToUtf8(s);
+    }
+    PM_STATE State() {
+        PM_STATE s{};
+        EXPECT_EQ(H().pm->get_State(&s), S_OK);
+        return s;
+    }
+    PM_TOPOLOGY Topology() {
+        PM_TOPOLOGY t{};
+        EXPECT_EQ(H().pm->get_Topology(&t), S_OK);
+        return t;
+    }
+    // Null, or the port manager itself (checked), with the reference released.
+    bool PortManagerRecommended() {
+        IUnknown* unk = nullptr;
+        EXPECT_EQ(H().pm->get_RecommendedPortManager(&unk), S_OK);
+        if (unk == nullptr) {
+            return false;
+        }
+        EXPECT_EQ(unk, static_cast<IUnknown*>(H().pm));
+        unk->Release();
+        return true;
+    }
+
+    // Sinks outlive the port manager, which releases them at its end.
+    RecordingSink& NewSink() { return sinks.emplace_back(); }
+    // A fresh port manager (the previous one is released).
+    PortManagerWithFakeStun& H() { return *holder; }
+    void Renew() { holder = std::make_unique<PortManagerWithFakeStun>(); }
+
+    testsupport::FakeNetworkInfo net;
+    FixedUpnpProbe upnp;
+    std::deque<RecordingSink> sinks;
+    std::unique_ptr<PortManagerWithFakeStun> holder = std::make_unique<PortManagerWithFakeStun>();
+};
+
+HRESULT Init(IAdvancedPortManager* pm, BSTR stun, LONG start, LONG count, BSTR sip, BSTR media,
+             LONG refresh = 30000) {
+    return pm->InitializeEx2(stun, start, count, sip, media, VARIANT_TRUE, VARIANT_TRUE, refresh,
+                             VARIANT_TRUE, VARIANT_TRUE, VARIANT_TRUE);
+}
+
+TEST_F(PortManager, DefaultsBeforeInitialization) {
+    BStr stale(u"x");
+    BSTR server = stale.Get();
+    ASSERT_EQ(H().pm->get_StunServer(&server), S_OK);
+    EXPECT_EQ(server, nullptr);
+    LONG value = 0;
+    H().pm->get_StartingPort(&value);
+    EXPECT_EQ(value, 5004);
+    H().pm->get_NumberOfPorts(&value);
+    EXPECT_EQ(value, 16);
+    EXPECT_EQ(State(), PMS_UNINITIALIZED);
+    EXPECT_EQ(Topology(), PMT_UNKNOWN);
+    EXPECT_FALSE(PortManagerRecommended());
+    EXPECT_EQ(SipServer(), "");
+    VARIANT_BOOL upnpEnabled = VARIANT_TRUE;
+    H().pm->get_RecommendedUpnpEnabled(&upnpEnabled);
+    EXPECT_EQ(upnpEnabled, VARIANT_FALSE);
+    EXPECT_EQ(Suffix(), "");
+    EXPECT_EQ(Private(), "");
+    EXPECT_EQ(Public(), "");
+    EXPECT_EQ(H().pm->get_State(nullptr), E_POINTER);
+    EXPECT_EQ(H().pm->get_StunServer(nullptr), E_POINTER);
+    EXPECT_EQ(H().pm->get_RecommendedPortManager(nullptr), E_POINTER);
+}
+
+TEST_F(PortManager, InitializeChecksRunInOrderAndChangeNothingOnFailure) {
+    BStr stun("stun.example.net");
+    BStr sip("sip");
+    BStr media("media");
+    IAdvancedPortManager* pm = H().pm;
+    // A null server name wins over bad ports.
+    EXPECT_EQ(Init(pm, nullptr, 1, 5000, sip.Get(), media.Get()), E_POINTER);
+    EXPECT_EQ(Init(pm, stun.Get(), 1023, 16, sip.Get(), media.Get()), E_INVALIDARG);
+    EXPECT_EQ(Init(pm, stun.Get(), 65535, 0, sip.Get(), media.Get()), E_INVALIDARG);
+    EXPECT_EQ(Init(pm, stun.Get(), 64511, 1024, sip.Get(), media.Get()), E_INVALIDARG);
+    EXPECT_EQ(Init(pm, stun.Get(), 2000, 1025, sip.Get(), media.Get()), E_INVALIDARG);
+    // On a new object a null proxy is E_POINTER; a short refresh interval E_INVALIDARG.
+    EXPECT_EQ(Init(pm, stun.Get(), 5004, 16, nullptr, media.Get()), E_POINTER);
+    EXPECT_EQ(Init(pm, stun.Get(), 5004, 16, sip.Get(), nullptr), E_POINTER);
+    EXPECT_EQ(Init(pm, stun.Get(), 5004, 16, sip.Get(), media.Get(), 29999), E_INVALIDARG);
+    EXPECT_EQ(State(), PMS_UNINITIALIZED);
+    LONG value = 0;
+    pm->get_StartingPort(&value);
+    EXPECT_EQ(value, 5004);
+
+    // The boundary values that pass: sum 65534, no lower bound on the count.
+    ASSERT_EQ(Init(pm, stun.Get(), 64510, 1024, sip.Get(), media.Get(), 30000), S_OK);
+    pm->get_StartingPort(&value);
+    EXPECT_EQ(value, 64510);
+    pm->get_NumberOfPorts(&value);
+    EXPECT_EQ(value, 1024);
+    BSTR server = nullptr;
+    pm->get_StunServer(&server);
+    EXPECT_EQ(ToUtf8(server), "stun.example.net");
+
+    // Initialised: ports are still checked first, then the state, and only then the proxies.
+    EXPECT_EQ(Init(pm, stun.Get(), 1023, 16, sip.Get(), media.Get()), E_INVALIDARG);
+    EXPECT_EQ(Init(pm, stun.Get(), 5004, 16, sip.Get(), media.Get()), E_FAIL);
+    EXPECT_EQ(Init(pm, stun.Get(), 5004, 16, nullptr, media.Get()), E_FAIL);
+}
+
+TEST_F(PortManager, CountOfZeroOrBelowAndAnEmptyServerAreAccepted) {
+    for (LONG count : {0, -5}) {
+        PortManagerWithFakeStun other;
+        BStr empty("");
+        BStr sip("sip");
+        BStr media("media");
+        EXPECT_EQ(Init(other.pm, empty.Get(), 1024, count, sip.Get(), media.Get()), S_OK);
+    }
+}
+
+TEST_F(PortManager, InitializeExUsesTheDefaultRefreshPolicy) {
+    BStr stun("s");
+    BStr sip("sip");
+    BStr media("media");
+    RecordingSink& sink = NewSink();
+    H().Connect(sink);
+    EXPECT_EQ(H().pm->InitializeEx(stun.Get(), 5004, 16, sip.Get(), media.Get(), VARIANT_TRUE,
+                                   VARIANT_TRUE),
+              S_OK);
+    EXPECT_EQ(sink.received.size(), 1u);
+}
+
+TEST_F(PortManager, BothDiscoveriesDisabledCompleteInsideInitialize) {
+    RecordingSink& sink = NewSink();
+    H().Connect(sink);
+    ASSERT_EQ(H().Initialize(false, false), S_OK);
+    ASSERT_EQ(sink.received.size(), 1u);  // fired before InitializeEx2 returned
+    EXPECT_EQ(sink.received[0].type, PME_UPDATED);
+    EXPECT_EQ(sink.received[0].state, PMS_COMPLETED);
+    EXPECT_EQ(State(), PMS_COMPLETED);
+    EXPECT_EQ(Topology(), PMT_UNKNOWN);
+    EXPECT_EQ(SipServer(), "media.example.net");
+    EXPECT_EQ(Private(), "192.0.2.10");
+    EXPECT_EQ(Public(), "192.0.2.10");
+    EXPECT_EQ(Suffix(), "");
+    EXPECT_TRUE(PortManagerRecommended());
+}
+
+TEST_F(PortManager, RefreshBeforeInitializeFailsAndChangesNothing) {
+    EXPECT_EQ(H().pm->Refresh(), E_FAIL);
+    EXPECT_EQ(State(), PMS_UNINITIALIZED);
+    EXPECT_EQ(H().Initialize(false, false), S_OK);
+}
+
+TEST_F(PortManager, ShutdownTwiceSucceedsAndKeepsTheState) {
+    ASSERT_EQ(H().Initialize(false, false), S_OK);
+    EXPECT_EQ(H().pm->Shutdown(), S_OK);
+    EXPECT_EQ(H().pm->Shutdown(), S_OK);
+    EXPECT_EQ(State(), PMS_COMPLETED);
+    EXPECT_EQ(H().Initialize(false, false), E_FAIL);  // initialised at most once
+}
+
+TEST_F(PortManager, ErrorCanBeDiagnosedBoundaries) {
+    struct Case {
+        uint32_t code;
+        VARIANT_BOOL expected;
+    };
+    const Case cases[] = {{0x80EE000C, VARIANT_TRUE},  {0x80EF01F5, VARIANT_TRUE},
+                          {0x80EF02BB, VARIANT_TRUE},  {0x80EF01F4, VARIANT_FALSE},
+                          {0x80EF02BC, VARIANT_FALSE}, {0x80EE000B, VARIANT_FALSE},
+                          {0, VARIANT_FALSE},          {0xFFFFFFFF, VARIANT_FALSE}};
+    for (const auto& c : cases) {
+        VARIANT_BOOL result = 7;
+        EXPECT_EQ(H().pm->ErrorCanBeDiagnosed(static_cast<LONG>(c.code), &result), S_OK);
+        EXPECT_EQ(result, c.expected) << std::hex << c.code;
+    }
+    EXPECT_EQ(H().pm->ErrorCanBeDiagnosed(0, nullptr), E_POINTER);
+}
+
+TEST_F(PortManager, UdpPacketsInPassesTheHostCounterOrItsError) {
+    LONG count = 0;
+    ASSERT_EQ(H().pm->get_UDPPacketsIn(&count), S_OK);
+    EXPECT_EQ(count, 42);
+    net.udpError = 2;
+    count = 9;
+    EXPECT_EQ(static_cast<uint32_t>(H().pm->get_UDPPacketsIn(&count)), 0x80070002u);
+    EXPECT_EQ(count, 9);
+    EXPECT_EQ(H().pm->get_UDPPacketsIn(nullptr), E_POINTER);
+}
+
+// The outcome of one STUN pass with the given entries.
+struct Outcome {
+    PM_TOPOLOGY topology;
+    std::string privateAddress;
+    std::string publicAddress;
+    std::string sipServer;
+    std::string suffix;
+    bool portManagerRecommended;
+};
+
+class StunOutcome : public PortManager {
+  protected:
+    Outcome Run(std::initializer_list<stun::STUNResultEntry> entries, int32_t count = -1) {
+        H().nextList.count = count >= 0 ? count : static_cast<int32_t>(entries.size());
+        int i = 0;
+        for (const auto& e : entries) {
+            H().nextList.entries[i++] = e;
+        }
+        RecordingSink& sink = NewSink();
+        H().Connect(sink);
+        EXPECT_EQ(H().Initialize(false, true), S_OK);
+        EXPECT_EQ(State(), PMS_INITIALIZING);
+        PumpUntilEvents(sink, 1);
+        EXPECT_EQ(sink.received.size(), 1u);
+        EXPECT_EQ(State(), PMS_COMPLETED);
+        return {Topology(), Private(), Public(), SipServer(), Suffix(), PortManagerRecommended()};
+    }
+};
+
+TEST_F(StunOutcome, LeastRestrictiveClassifiedEntryIsChosen) {
+    const Outcome o = Run({{A, stun::STUN_RESULT_SYMMETRIC_NAT, stun::kNoPublicAddress},
+                           {B, stun::STUN_RESULT_FULL_CONE_NAT, Q}});
+    EXPECT_EQ(o.topology, PMT_STUN_FULL_CONE_NAT);
+    EXPECT_EQ(o.privateAddress, "192.0.2.11");
+    EXPECT_EQ(o.publicAddress, "203.0.113.9");
+    EXPECT_EQ(o.sipServer, "sip.example.net");
+    EXPECT_EQ(o.suffix, "STUN");
+    EXPECT_TRUE(o.portManagerRecommended);
+}
+
+TEST_F(StunOutcome, UnclassifiedFirstEntryStaysChosen) {
+    const Outcome o = Run({{A, stun::STUN_RESULT_UNKNOWN, 0}, {B, stun::STUN_RESULT_OPEN, Q}});
+    EXPECT_EQ(o.topology, PMT_UNKNOWN);
+    EXPECT_EQ(o.sipServer, "media.example.net");
+    EXPECT_EQ(o.privateAddress, "192.0.2.10");  // from the monitor
+    EXPECT_EQ(o.publicAddress, "192.0.2.10");
+    EXPECT_EQ(o.suffix, "");
+}
+
+TEST_F(StunOutcome, EqualResultsKeepTheFirst) {
+    const Outcome o = Run({{A, stun::STUN_RESULT_RESTRICTED_CONE_NAT, P},
+                           {B, stun::STUN_RESULT_RESTRICTED_CONE_NAT, Q}});
+    EXPECT_EQ(o.topology, PMT_STUN_RESTRICTED_CONE_NAT);
+    EXPECT_EQ(o.privateAddress, "192.0.2.10");
+    EXPECT_EQ(o.publicAddress, "198.51.100.7");
+}
+
+TEST_F(StunOutcome, EveryConeResultRecommendsTheSipProxyWithStunAddresses) {
+    for (uint8_t r = stun::STUN_RESULT_OPEN; r <= stun::STUN_RESULT_PORT_RESTRICTED_CONE_NAT; ++r) {
+        Renew();
+        const Outcome o = Run({{B, r, P}});
+        EXPECT_EQ(o.topology, static_cast<PM_TOPOLOGY>(r));
+        EXPECT_EQ(o.privateAddress, "192.0.2.11");
+        EXPECT_EQ(o.publicAddress, "198.51.100.7");
+        EXPECT_EQ(o.sipServer, "sip.example.net");
+        EXPECT_EQ(o.suffix, "STUN");
+        EXPECT_TRUE(o.portManagerRecommended);
+    }
+}
+
+TEST_F(StunOutcome, SymmetricResultsRecommendTheMediaProxyWithTheLocalAddress) {
+    for (uint8_t r : {stun::STUN_RESULT_SYMMETRIC_FIREWALL, stun::STUN_RESULT_SYMMETRIC_NAT}) {
+        Renew();
+        const Outcome o = Run({{B, r, P}});
+        EXPECT_EQ(o.topology, static_cast<PM_TOPOLOGY>(r));
+        EXPECT_EQ(o.privateAddress, "192.0.2.11");
+        EXPECT_EQ(o.publicAddress, "192.0.2.11");
+        EXPECT_EQ(o.sipServer, "media.example.net");
+        EXPECT_EQ(o.suffix, "");
+        EXPECT_TRUE(o.portManagerRecommended);
+    }
+}
+
+TEST_F(StunOutcome, BlockedFallsBackButKeepsItsTopology) {
+    const Outcome o = Run({{B, stun::STUN_RESULT_BLOCKED, stun::kNoPublicAddress}});
+    EXPECT_EQ(o.topology, PMT_STUN_BLOCKED);
+    EXPECT_EQ(o.privateAddress, "192.0.2.10");
+    EXPECT_EQ(o.publicAddress, "192.0.2.10");
+    EXPECT_EQ(o.sipServer, "media.example.net");
+    EXPECT_TRUE(o.portManagerRecommended);
+}
+
+TEST_F(StunOutcome, BlockedWithNoLocalAddressRecommendsNoPortManager) {
+    net.adapters.clear();
+    const Outcome o = Run({{B, stun::STUN_RESULT_BLOCKED, stun::kNoPublicAddress}});
+    EXPECT_EQ(o.privateAddress, "");
+    EXPECT_FALSE(o.portManagerRecommended);
+}
+
+TEST_F(StunOutcome, ValueOutsideTheResultsIsLoggedAndFallsBack) {
+    std::vector<std::string> lines;
+    platform::SetDebugOutputSink([&](std::string_view l) { lines.emplace_back(l); });
+    foundation::Logger().Initialize(std::nullopt, std::nullopt, std::nullopt, 0, true);
+    const Outcome o = Run({{B, 9, P}});
+    foundation::Logger().Initialize(std::nullopt, std::nullopt, std::nullopt, 0, false);
+    platform::SetDebugOutputSink(nullptr);
+    EXPECT_EQ(o.topology, PMT_UNKNOWN);
+    EXPECT_EQ(o.privateAddress, "192.0.2.11");
+    EXPECT_EQ(o.publicAddress, "192.0.2.11");
+    EXPECT_EQ(o.sipServer, "media.example.net");
+    bool logged = false;
+    for (const auto& l : lines) {
+        logged |= l.find("ERROR, CAdvancedPortManager::OnStunRefresh pResult->stunResult = 0x9") !=
+                  std::string::npos;
+    }
+    EXPECT_TRUE(logged);
+}
+
+TEST_F(StunOutcome, EmptyListCompletesWithTheFallBack) {
+    const Outcome o = Run({}, 0);
+    EXPECT_EQ(o.topology, PMT_UNKNOWN);
+    EXPECT_EQ(o.sipServer, "media.example.net");
+    EXPECT_EQ(o.privateAddress, "192.0.2.10");
+}
+
+TEST_F(PortManager, RefreshClearsTheRecommendationButKeepsTheAddresses) {
+    H().nextList.count = 1;
+    H().nextList.entries[0] = {A, stun::STUN_RESULT_FULL_CONE_NAT, P};
+    RecordingSink& sink = NewSink();
+    H().Connect(sink);
+    ASSERT_EQ(H().Initialize(false, true), S_OK);
+    PumpUntilEvents(sink, 1);
+    H().stun->postOnRefresh = false;  // the next pass does not end
+    ASSERT_EQ(H().pm->Refresh(), S_OK);
+    EXPECT_EQ(State(), PMS_INITIALIZING);
+    EXPECT_EQ(Topology(), PMT_UNKNOWN);
+    EXPECT_FALSE(PortManagerRecommended());
+    EXPECT_EQ(SipServer(), "");
+    EXPECT_EQ(Suffix(), "");
+    EXPECT_EQ(Private(), "192.0.2.10");
+    EXPECT_EQ(Public(), "198.51.100.7");
+}
+
+TEST_F(PortManager, StaleOrUnreadyResultMessagesAreIgnored) {
+    H().nextReady = false;
+    RecordingSink& sink = NewSink();
+    H().Connect(sink);
+    ASSERT_EQ(H().Initialize(false, true), S_OK);
+    platform::RunMessageLoopUntil([] { return false; }, 100);
+    EXPECT_TRUE(sink.received.empty());
+    EXPECT_EQ(State(), PMS_INITIALIZING);
+}
+
+TEST_F(PortManager, RefreshAfterShutdownFallsBackInsteadOfUsingTheGoneService) {
+    RecordingSink& sink = NewSink();
+    H().Connect(sink);
+    ASSERT_EQ(H().Initialize(false, true), S_OK);
+    PumpUntilEvents(sink, 1);
+    H().pm->Shutdown();
+    ASSERT_EQ(H().pm->Refresh(), S_OK);
+    ASSERT_EQ(sink.received.size(), 2u);
+    EXPECT_EQ(State(), PMS_COMPLETED);
+    EXPECT_EQ(SipServer(), "media.example.net");
+}
+
+TEST_F(PortManager, UpnpGatewayRecommendsTheSipProxy) {
+    FixedUpnpProbe gateway(true);
+    RecordingSink& sink = NewSink();
+    H().Connect(sink);
+    ASSERT_EQ(H().Initialize(true, true), S_OK);
+    EXPECT_EQ(State(), PMS_INITIALIZING);
+    PumpUntilEvents(sink, 1);
+    EXPECT_EQ(Topology(), PMT_UPNP_ENABLED_NAT_OR_FIREWALL);
+    EXPECT_EQ(State(), PMS_COMPLETED);
+    EXPECT_EQ(SipServer(), "sip.example.net");
+    VARIANT_BOOL enabled = VARIANT_FALSE;
+    H().pm->get_RecommendedUpnpEnabled(&enabled);
+    EXPECT_EQ(enabled, VARIANT_TRUE);
+    // No address was ever learnt, so no port manager is recommended.
+    EXPECT_FALSE(PortManagerRecommended());
+    EXPECT_EQ(H().stun->refreshes, 0);
+}
+
+TEST_F(PortManager, NoUpnpGatewayGoesOnToStun) {
+    H().nextList.count = 1;
+    H().nextList.entries[0] = {A, stun::STUN_RESULT_PORT_RESTRICTED_CONE_NAT, P};
+    RecordingSink& sink = NewSink();
+    H().Connect(sink);
+    ASSERT_EQ(H().Initialize(true, true), S_OK);
+    PumpUntilEvents(sink, 1);
+    EXPECT_EQ(H().stun->refreshes, 1);
+    EXPECT_EQ(Topology(), PMT_STUN_PORT_RESTRICTED_CONE_NAT);
+}
+
+TEST_F(PortManager, NoUpnpGatewayWithStunDisabledFallsBack) {
+    RecordingSink& sink = NewSink();
+    H().Connect(sink);
+    ASSERT_EQ(H().Initialize(true, false), S_OK);
+    PumpUntilEvents(sink, 1);
+    EXPECT_EQ(Topology(), PMT_UNKNOWN);
+    EXPECT_EQ(SipServer(), "media.example.net");
+}
+
+TEST_F(PortManager, EventsReachEverySinkInConnectionOrder) {
+    std::vector<RecordingSink*> order;
+    RecordingSink& first = NewSink();
+    RecordingSink& second = NewSink();
+    first.order = &order;
+    second.order = &order;
+    EXPECT_EQ(H().Connect(first), 1u);
+    EXPECT_EQ(H().Connect(second), 2u);
+    ASSERT_EQ(H().Initialize(false, false), S_OK);
+    ASSERT_EQ(order.size(), 2u);
+    EXPECT_EQ(order[0], &first);
+    EXPECT_EQ(order[1], &second);
+    // The event names the very object the sinks are connected to.
+    EXPECT_EQ(first.received[0].portManager, H().pm);
+}
+
+TEST_F(PortManager, SinkThatNoLongerAnswersIsSkippedAndTheNextStillReceives) {
+    RecordingSink& first = NewSink();
+    RecordingSink& second = NewSink();
+    first.answerEventQueries = 1;  // enough to connect, not to receive
+    H().Connect(first);
+    H().Connect(second);
+    ASSERT_EQ(H().Initialize(false, false), S_OK);
+    EXPECT_TRUE(first.received.empty());
+    EXPECT_EQ(second.received.size(), 1u);
+}
+
+TEST_F(PortManager, SinkMayRefreshFromInsideItsEvent) {
+    RecordingSink& sink = NewSink();
+    sink.onEvent = [&](PM_EVENT) {
+        if (sink.received.size() == 1) {
+            EXPECT_EQ(H().pm->Refresh(), S_OK);
+        }
+    };
+    H().Connect(sink);
+    ASSERT_EQ(H().Initialize(false, false), S_OK);
+    EXPECT_EQ(sink.received.size(), 2u);  // the nested event came from inside the first
+}
+
+TEST_F(PortManager, AdviseAndUnadviseErrors) {
+    IConnectionPointContainer* container = nullptr;
+    ASSERT_EQ(
+        H().pm->QueryInterface(IID_IConnectionPointContainer, reinterpret_cast<void**>(&container)),
+        S_OK);
+    IConnectionPoint* point = nullptr;
+    EXPECT_EQ(container->FindConnectionPoint(IID_IDispatch, &point), CONNECT_E_NOCONNECTION);
+    ASSERT_EQ(container->FindConnectionPoint(DIID__IAdvancedPortManagerEvents, &point), S_OK);
+    RecordingSink& refuser = NewSink();
+    refuser.answerEventQueries = 0;
+    DWORD cookie = 99;
+    EXPECT_EQ(point->Advise(&refuser, &cookie), CONNECT_E_CANNOTCONNECT);
+    EXPECT_EQ(refuser.refs.load(), 0u);
+    RecordingSink& sink = NewSink();
+    ASSERT_EQ(point->Advise(&sink, &cookie), S_OK);
+    EXPECT_EQ(cookie, 1u);
+    EXPECT_EQ(point->Unadvise(0), CONNECT_E_NOCONNECTION);
+    EXPECT_EQ(point->Unadvise(2), CONNECT_E_NOCONNECTION);
+    EXPECT_EQ(point->Unadvise(cookie), S_OK);
+    EXPECT_EQ(point->Unadvise(cookie), CONNECT_E_NOCONNECTION);
+    EXPECT_EQ(sink.refs.load(), 0u);
+    IID iid{};
+    point->GetConnectionInterface(&iid);
+    EXPECT_EQ(iid, DIID__IAdvancedPortManagerEvents);
+    point->Release();
+    container->Release();
+}
+
+TEST_F(PortManager, ReleasingTheObjectReleasesConnectedSinks) {
+    RecordingSink& sink = NewSink();
+    H().Connect(sink);
+    EXPECT_EQ(sink.refs.load(), 1u);
+    H().pm->Release();
+    H().pm = nullptr;
+    EXPECT_EQ(sink.refs.load(), 0u);
+}
+
+TEST_F(PortManager, EventObjectKeepsThePortManagerAndAcceptsANullPut) {
+    IPortManagerUpdateEvent* kept = nullptr;
+    RecordingSink& sink = NewSink();
+    sink.onEvent = [&](PM_EVENT) {
+        // The sink keeps no reference; the test takes one through the event's property.
+    };
+    H().Connect(sink);
+    ASSERT_EQ(H().Initialize(false, false), S_OK);
+    ASSERT_EQ(portmanager::PortManagerUpdateEvent::Create(&kept), S_OK);
+    ASSERT_EQ(kept->put_PortManager(H().pm), S_OK);
+    IAdvancedPortManager* pm = nullptr;
+    ASSERT_EQ(kept->get_PortManager(&pm), S_OK);
+    EXPECT_EQ(pm, H().pm);
+    pm->Release();
+    EXPECT_EQ(kept->put_PortManager(nullptr), S_OK);
+    EXPECT_EQ(kept->get_PortManager(&pm), E_POINTER);
+    EXPECT_EQ(pm, nullptr);
+    kept->Release();
+}
+
+TEST_F(PortManager, InterfacesAndErrorInfo) {
+    IPortMappingProvider* first = nullptr;
+    IPortMappingProvider* second = nullptr;
+    ASSERT_EQ(H().pm->QueryInterface(IID_IPortMappingProvider, reinterpret_cast<void**>(&first)),
+              S_OK);
+    ASSERT_EQ(H().pm->QueryInterface(IID_IPortMappingProvider2, reinterpret_cast<void**>(&second)),
+              S_OK);
+    EXPECT_EQ(first, second);  // one implementation under two ids
+    first->Release();
+    second->Release();
+    ISupportErrorInfo* info = nullptr;
+    ASSERT_EQ(H().pm->QueryInterface(IID_ISupportErrorInfo, reinterpret_cast<void**>(&info)), S_OK);
+    EXPECT_EQ(info->InterfaceSupportsErrorInfo(IID_IAdvancedPortManager), S_OK);
+    EXPECT_EQ(info->InterfaceSupportsErrorInfo(IID_INqDiagnostics), S_FALSE);
+    EXPECT_EQ(info->InterfaceSupportsErrorInfo(IID_IDispatch), S_FALSE);
+    info->Release();
+    void* none = &info;
+    EXPECT_EQ(H().pm->QueryInterface(IID_IConnectionPoint, &none), E_NOINTERFACE);
+    EXPECT_EQ(none, nullptr);
+}
+
+TEST_F(PortManager, InitiateShutdownFiresShutdownOnceOnItsFirstTick) {
+    RecordingSink& sink = NewSink();
+    H().Connect(sink);
+    ASSERT_EQ(H().pm->InitiateShutdown(), S_OK);
+    PumpUntilEvents(sink, 1);
+    EXPECT_EQ(sink.received[0].type, PME_SHUTDOWN);
+    platform::RunMessageLoopUntil([] { return false; }, 1300);
+    EXPECT_EQ(sink.received.size(), 1u);
+}
+
+}  // namespace

@@ -1,0 +1,116 @@
+#include "tests/support/PortManagerDoubles.h"
+
+namespace testsupport {
+
+HRESULT RecordingSink::QueryInterface(REFIID riid, void** ppv) {
+    if (ppv == nullptr) {
+        return E_POINTER;
+    }
+    *ppv = nullptr;
+    if (riid == IID_IUnknown) {
+        *ppv = static_cast<IUnknown*>(this);
+    } else if (riid == DIID__IAdvancedPortManagerEvents) {
+        if (answerEventQueries == 0) {
+            return E_NOINTERFACE;
+        }
+        if (answerEventQueries > 0) {
+            --answerEventQueries;
+        }
+        *ppv = static_cast<_IAdvancedPortManagerEvents*>(this);
+    } else {
+        return E_NOINTERFACE;
+    }
+    AddRef();
+    return S_OK;
+}
+
+HRESULT RecordingSink::Event(PM_EVENT type, IDispatch* event) {
+    Received r{type, nullptr, PMS_UNINITIALIZED};
+    IPortManagerUpdateEvent* update = nullptr;
+    if (event != nullptr && SUCCEEDED(event->QueryInterface(IID_IPortManagerUpdateEvent,
+                                                            reinterpret_cast<void**>(&update)))) {
+        IAdvancedPortManager* pm = nullptr;
+        if (SUCCEEDED(update->get_PortManager(&pm)) && pm != nullptr) {
+            r.portManager = pm;
+            pm->get_State(&r.state);
+            pm->Release();
+        }
+        update->Release();
+    }
+    received.push_back(r);
+    if (order != nullptr) {
+        order->push_back(this);
+    }
+    if (onEvent) {
+        onEvent(type);
+    }
+    return S_OK;
+}
+
+HRESULT FakeStunService::Refresh() {
+    running = true;
+    ++refreshes;
+    if (postOnRefresh) {
+        platform::PostMessage(m_window, m_message, m_wParam, 0);
+    }
+    return S_OK;
+}
+
+bool FakeStunService::GetSTUNResult(stun::STUNResultList* result) {
+    if (result == nullptr || !ready) {
+        return false;
+    }
+    *result = list;
+    return true;
+}
+
+PortManagerWithFakeStun::PortManagerWithFakeStun() {
+    portmanager::PortManagerServices services;
+    services.createStunService = [this](const char*, platform::WindowHandle window,
+                                        platform::UINT message, platform::WPARAM wParam) {
+        auto service = std::make_unique<FakeStunService>(window, message, wParam);
+        service->list = nextList;
+        service->ready = nextReady;
+        stun = service.get();
+        return std::unique_ptr<stun::ISTUNResult>(std::move(service));
+    };
+    portmanager::CAdvancedPortManager::CreateInstance(
+        IID_IAdvancedPortManager, reinterpret_cast<void**>(&pm), std::move(services));
+}
+
+PortManagerWithFakeStun::~PortManagerWithFakeStun() {
+    if (pm != nullptr) {
+        pm->Release();
+    }
+}
+
+DWORD PortManagerWithFakeStun::Connect(RecordingSink& sink) {
+    IConnectionPointContainer* container = nullptr;
+    pm->QueryInterface(IID_IConnectionPointContainer, reinterpret_cast<void**>(&container));
+    IConnectionPoint* point = nullptr;
+    container->FindConnectionPoint(DIID__IAdvancedPortManagerEvents, &point);
+    DWORD cookie = 0;
+    point->Advise(&sink, &cookie);
+    point->Release();
+    container->Release();
+    return cookie;
+}
+
+HRESULT PortManagerWithFakeStun::Initialize(bool upnp, bool stunEnabled, const char* sipProxy,
+                                            const char* mediaProxy) {
+    BStr server("stun.example.net");
+    BStr sip(sipProxy);
+    BStr media(mediaProxy);
+    return pm->InitializeEx2(server.Get(), 5004, 16, sip.Get(), media.Get(),
+                             upnp ? VARIANT_FALSE : VARIANT_TRUE,
+                             stunEnabled ? VARIANT_FALSE : VARIANT_TRUE, 30000, VARIANT_TRUE,
+                             VARIANT_TRUE, VARIANT_TRUE);
+}
+
+std::string ToUtf8(BSTR text) {
+    std::string s = Utf8FromBstr(text);
+    SysFreeString(text);
+    return s;
+}
+
+}  // namespace testsupport

@@ -1,0 +1,221 @@
+#include "tools/nqpm/Discovery.h"
+
+#include <cstdio>
+
+#include "platform/console.h"
+#include "platform/kernel.h"
+#include "platform/message.h"
+#include "portmanager/AdvancedPortManager.h"
+
+namespace nqpm {
+
+namespace {
+
+std::string Text(HRESULT (IAdvancedPortManager::*getter)(BSTR*), IAdvancedPortManager* pm) {
+    BStr value;
+    (pm->*getter)(value.Out());
+    return value.Utf8();
+}
+
+bool PortManagerRecommended(IAdvancedPortManager* pm) {
+    IUnknown* unk = nullptr;
+    pm->get_RecommendedPortManager(&unk);
+    if (unk == nullptr) {
+        return false;
+    }
+    unk->Release();
+    return true;
+}
+
+}  // namespace
+
+const char* StateName(PM_STATE state) {
+    switch (state) {
+        case PMS_UNINITIALIZED:
+            return "PMS_UNINITIALIZED";
+        case PMS_INITIALIZING:
+            return "PMS_INITIALIZING";
+        case PMS_COMPLETED:
+            return "PMS_COMPLETED";
+    }
+    return "invalid";
+}
+
+const char* TopologyName(PM_TOPOLOGY topology) {
+    static const char* const names[] = {"PMT_UNKNOWN",
+                                        "PMT_STUN_OPEN",
+                                        "PMT_STUN_FULL_CONE_FIREWALL",
+                                        "PMT_STUN_FULL_CONE_NAT",
+                                        "PMT_STUN_RESTRICTED_CONE_NAT",
+                                        "PMT_STUN_PORT_RESTRICTED_CONE_NAT",
+                                        "PMT_STUN_SYMMETRIC_FIREWALL",
+                                        "PMT_STUN_SYMMETRIC_NAT",
+                                        "PMT_STUN_BLOCKED",
+                                        "PMT_UPNP_ENABLED_NAT_OR_FIREWALL"};
+    return topology >= 0 && topology <= PMT_UPNP_ENABLED_NAT_OR_FIREWALL ? names[topology]
+                                                                         : "invalid";
+}
+
+std::vector<OptionSpec> DiscoveryOptionSpecs() {
+    return {{"stun", true},     {"sip-proxy", true}, {"media-proxy", true},
+            {"no-upnp", false}, {"no-stun", false},  {"timeout", true}};
+}
+
+DiscoveryOptions ReadDiscoveryOptions(const Options& options) {
+    DiscoveryOptions d;
+    d.stunServers =
+        options.Has("no-stun") && !options.Has("stun") ? std::string() : options.Required("stun");
+    // The proxies are only texts to the port manager; check the port part when one is given.
+    d.sipProxy = options.Value("sip-proxy");
+    d.mediaProxy = options.Value("media-proxy");
+    if (!d.sipProxy.empty()) {
+        ParseHostPort("sip-proxy", d.sipProxy, 5060);
+    }
+    if (!d.mediaProxy.empty()) {
+        ParseHostPort("media-proxy", d.mediaProxy, 5060);
+    }
+    d.upnp = !options.Has("no-upnp");
+    d.stun = !options.Has("no-stun");
+    d.timeoutSeconds = options.Seconds("timeout", 60);
+    return d;
+}
+
+Discovery::Discovery() = default;
+
+Discovery::~Discovery() {
+    if (m_pm != nullptr) {
+        if (m_cookie != 0) {
+            IConnectionPointContainer* container = nullptr;
+            if (SUCCEEDED(m_pm->QueryInterface(IID_IConnectionPointContainer,
+                                               reinterpret_cast<void**>(&container)))) {
+                IConnectionPoint* point = nullptr;
+                if (SUCCEEDED(
+                        container->FindConnectionPoint(DIID__IAdvancedPortManagerEvents, &point))) {
+                    point->Unadvise(m_cookie);
+                    point->Release();
+                }
+                container->Release();
+            }
+        }
+        m_pm->Shutdown();
+        m_pm->Release();
+    }
+}
+
+HRESULT Discovery::QueryInterface(REFIID riid, void** ppv) {
+    if (ppv == nullptr) {
+        return E_POINTER;
+    }
+    if (riid == IID_IUnknown || riid == DIID__IAdvancedPortManagerEvents) {
+        *ppv = static_cast<_IAdvancedPortManagerEvents*>(this);
+        return S_OK;
+    }
+    *ppv = nullptr;
+    return E_NOINTERFACE;
+}
+
+HRESULT Discovery::Event(PM_EVENT type, IDispatch*) {
+    if (type >= 0 && type < 4) {
+        ++m_events[type];
+    }
+    if (type == PME_NETWORK_CHANGE && m_onNetworkChange) {
+        m_onNetworkChange();
+    }
+    return S_OK;
+}
+
+int Discovery::Events(PM_EVENT type) const {
+    return type >= 0 && type < 4 ? m_events[type] : 0;
+}
+
+bool Discovery::Run(const DiscoveryOptions& options) {
+    HRESULT hr = portmanager::CAdvancedPortManager::CreateInstance(IID_IAdvancedPortManager,
+                                                                   reinterpret_cast<void**>(&m_pm));
+    if (FAILED(hr)) {
+        std::fprintf(stderr, "nqpm: cannot create the port manager (0x%08X)\n",
+                     static_cast<unsigned>(hr));
+        return false;
+    }
+    IConnectionPointContainer* container = nullptr;
+    IConnectionPoint* point = nullptr;
+    m_pm->QueryInterface(IID_IConnectionPointContainer, reinterpret_cast<void**>(&container));
+    container->FindConnectionPoint(DIID__IAdvancedPortManagerEvents, &point);
+    point->Advise(static_cast<_IAdvancedPortManagerEvents*>(this), &m_cookie);
+    point->Release();
+    container->Release();
+
+    BStr servers(options.stunServers);
+    BStr sip(options.sipProxy);
+    BStr media(options.mediaProxy);
+    hr = m_pm->InitializeEx2(servers.Get(), 5004, 16, sip.Get(), media.Get(),
+                             options.upnp ? VARIANT_FALSE : VARIANT_TRUE,
+                             options.stun ? VARIANT_FALSE : VARIANT_TRUE, 30000, VARIANT_TRUE,
+                             VARIANT_TRUE, VARIANT_TRUE);
+    if (FAILED(hr)) {
+        std::fprintf(stderr, "nqpm: InitializeEx2 failed (0x%08X)\n", static_cast<unsigned>(hr));
+        return false;
+    }
+    Progress("discovering the path to the Internet (UPnP gateway, then STUN)");
+    platform::InterruptDescriptor();
+    const bool done = platform::RunMessageLoopUntil(
+        [this] { return m_events[PME_UPDATED] > 0 || platform::InterruptRequested(); },
+        static_cast<int>(options.timeoutSeconds * 1000));
+    if (!done || m_events[PME_UPDATED] == 0) {
+        std::fprintf(stderr, "nqpm: no discovery outcome within %.0f s\n", options.timeoutSeconds);
+        return false;
+    }
+    return true;
+}
+
+void Discovery::PumpFor(double seconds) {
+    platform::RunMessageLoopUntil([] { return platform::InterruptRequested(); },
+                                  seconds < 0 ? -1 : static_cast<int>(seconds * 1000));
+}
+
+std::string Discovery::ReportText() const {
+    PM_STATE state{};
+    PM_TOPOLOGY topology{};
+    VARIANT_BOOL upnp = VARIANT_FALSE;
+    m_pm->get_State(&state);
+    m_pm->get_Topology(&topology);
+    m_pm->get_RecommendedUpnpEnabled(&upnp);
+    std::string out;
+    out += std::string("state:                    ") + StateName(state) + "\n";
+    out += std::string("topology:                 ") + TopologyName(topology) + " (" +
+           std::to_string(topology) + ")\n";
+    out += "private address:          " + Text(&IAdvancedPortManager::get_PrivateIpAddress, m_pm) +
+           "\n";
+    out += "public address:           " + Text(&IAdvancedPortManager::get_PublicIpAddress, m_pm) +
+           "\n";
+    out +=
+        "recommended SIP server:   " + Text(&IAdvancedPortManager::get_RecommendedSipServer, m_pm) +
+        "\n";
+    out += std::string("recommended UPnP enabled: ") + (upnp ? "yes" : "no") + "\n";
+    out += "client name suffix:       " + Text(&IAdvancedPortManager::get_ClientNameSuffix, m_pm) +
+           "\n";
+    out += std::string("port manager recommended: ") +
+           (PortManagerRecommended(m_pm) ? "yes" : "no") + "\n";
+    return out;
+}
+
+std::string Discovery::ReportJson() const {
+    PM_STATE state{};
+    PM_TOPOLOGY topology{};
+    VARIANT_BOOL upnp = VARIANT_FALSE;
+    m_pm->get_State(&state);
+    m_pm->get_Topology(&topology);
+    m_pm->get_RecommendedUpnpEnabled(&upnp);
+    JsonObject o;
+    o.Add("state", StateName(state))
+        .Add("topology", TopologyName(topology))
+        .Add("topology_code", static_cast<int64_t>(topology))
+        .Add("private", Text(&IAdvancedPortManager::get_PrivateIpAddress, m_pm))
+        .Add("public", Text(&IAdvancedPortManager::get_PublicIpAddress, m_pm))
+        .Add("recommended_sip_server", Text(&IAdvancedPortManager::get_RecommendedSipServer, m_pm))
+        .Add("recommended_upnp_enabled", upnp != VARIANT_FALSE)
+        .Add("client_name_suffix", Text(&IAdvancedPortManager::get_ClientNameSuffix, m_pm))
+        .Add("recommended_port_manager", PortManagerRecommended(m_pm));
+    return o.Str();
+}
+
+}  // namespace nqpm

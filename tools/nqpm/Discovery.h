@@ -1,0 +1,67 @@
+// A port manager driven as a softphone drives it: created on this thread, a sink connected,
+// initialised, and its message loop pumped until the discovery reports.
+#pragma once
+
+#include <functional>
+#include <string>
+#include <vector>
+
+#include <nqportmanager/NqPortManager.h>
+
+#include "tools/nqpm/Cli.h"
+
+namespace nqpm {
+
+struct DiscoveryOptions {
+    std::string stunServers;
+    std::string sipProxy;
+    std::string mediaProxy;
+    bool upnp = true;
+    bool stun = true;
+    double timeoutSeconds = 60;
+};
+
+// The options common to `discover` and `profile`.
+std::vector<OptionSpec> DiscoveryOptionSpecs();
+DiscoveryOptions ReadDiscoveryOptions(const Options& options);
+
+class Discovery final : public _IAdvancedPortManagerEvents {
+  public:
+    Discovery();
+    ~Discovery();
+    Discovery(const Discovery&) = delete;
+    Discovery& operator=(const Discovery&) = delete;
+
+    // Creates, connects and initialises; pumps until the first PME_UPDATED. False (with a
+    // message on stderr) on failure or time-out.
+    bool Run(const DiscoveryOptions& options);
+    // Pumps until the time passes or Ctrl-C / SIGTERM; -1 waits for the interrupt only.
+    void PumpFor(double seconds);
+
+    IAdvancedPortManager* PortManager() const { return m_pm; }
+    // The state, topology, addresses and recommendations, as text lines or one JSON object.
+    std::string ReportText() const;
+    std::string ReportJson() const;
+
+    int Events(PM_EVENT type) const;
+    // Called for every PME_NETWORK_CHANGE after the first update.
+    void OnNetworkChange(std::function<void()> callback) {
+        m_onNetworkChange = std::move(callback);
+    }
+
+    HRESULT QueryInterface(REFIID riid, void** ppv) override;
+    ULONG AddRef() override { return 2; }  // lives on the stack of its command
+    ULONG Release() override { return 1; }
+    HRESULT Event(PM_EVENT type, IDispatch* event) override;
+
+  private:
+    IAdvancedPortManager* m_pm = nullptr;
+    DWORD m_cookie = 0;
+    int m_events[4] = {0, 0, 0, 0};
+    std::function<void()> m_onNetworkChange;
+};
+
+const char* StateName(PM_STATE state);
+const char* TopologyName(PM_TOPOLOGY topology);
+
+}  // namespace nqpm

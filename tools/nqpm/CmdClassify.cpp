@@ -2,7 +2,10 @@
 #include <cstdio>
 
 #include "foundation/NetUtils.h"
+#include "platform/console.h"
+#include "platform/message.h"
 #include "stun/STUNClassify.h"
+#include "stun/STUNResult.h"
 #include "stun/STUNResults.h"
 #include "tools/nqpm/Cli.h"
 #include "tools/nqpm/Commands.h"
@@ -12,10 +15,45 @@ namespace nqpm {
 namespace {
 
 const char* const kUsage =
-    "usage: nqpm classify --stun LIST --local A.B.C.D [--json]\n"
-    "Classifies the path from the local address to the Internet with the classic STUN tests\n"
-    "(RFC 3489) against the first answering server of LIST (comma-separated host names or\n"
-    "dotted quads, port 3478). Takes up to about 20 s. Exit 0 whenever a result was obtained.\n";
+    "usage: nqpm classify --stun LIST [--local A.B.C.D] [--json]\n"
+    "Classifies the path to the Internet with the classic STUN tests (RFC 3489) against the\n"
+    "first answering server of LIST (comma-separated host names or dotted quads, port 3478):\n"
+    "from the given local address, or without --local from every usable local address (the\n"
+    "first address of each interface with a default gateway), as the port manager does. Takes\n"
+    "up to about 20 s per address. Exit 0 whenever a result was obtained.\n";
+
+constexpr platform::UINT kPassEnded = platform::WM_USER + 1;
+
+// Receives the service's message on this thread.
+class PassWindow final : public platform::MessageWindow {
+  public:
+    platform::LRESULT WindowProc(platform::UINT message, platform::WPARAM, platform::LPARAM,
+                                 bool& handled) override {
+        handled = message == kPassEnded;
+        ended = ended || handled;
+        return 0;
+    }
+    bool ended = false;
+};
+
+// One pass of the result service over every usable local address.
+bool ClassifyAll(const std::string& servers, stun::STUNResultList& list) {
+    PassWindow window;
+    if (!window.CreateMessageWindow()) {
+        return false;
+    }
+    stun::CSTUNResult service(servers.c_str(), window.Handle(), kPassEnded, 0);
+    if (FAILED(service.Refresh())) {
+        std::fprintf(stderr, "nqpm classify: the STUN service did not start\n");
+        return false;
+    }
+    platform::InterruptDescriptor();
+    platform::RunMessageLoopUntil([&] { return window.ended || platform::InterruptRequested(); },
+                                  -1);
+    const bool ok = window.ended && service.GetSTUNResult(&list);
+    service.Stop();
+    return ok;
+}
 
 }  // namespace
 
@@ -49,8 +87,20 @@ int RunClassify(int argc, char** argv) {
         return kExitOk;
     }
     const std::string servers = options.Required("stun");
-    const uint32_t local = ParseDottedQuad("local", options.Required("local"));
+    const bool oneAddress = options.Has("local");
+    const uint32_t local = oneAddress ? ParseDottedQuad("local", options.Value("local")) : 0;
     ConfigureLogging(options);
+
+    stun::STUNResultList list;
+    if (!oneAddress) {
+        Progress("classifying every usable local address (up to about 20 s each)");
+        if (!ClassifyAll(servers, list)) {
+            return kExitFailed;
+        }
+        std::printf("%s\n", options.Json() ? ClassificationJson(list).c_str()
+                                           : stun::FormatSTUNResults(list).c_str());
+        return kExitOk;
+    }
 
     Progress("looking for an answering STUN server");
     int32_t index = stun::STUN_TestServers(local, servers.c_str());
@@ -65,7 +115,6 @@ int RunClassify(int argc, char** argv) {
         return kExitFailed;
     }
     Progress(std::string("classifying against ") + token + " (up to about 20 s)");
-    stun::STUNResultList list;
     list.count = 1;
     list.entries[0].localAddress = local;
     stun::STUN_GetResult(server, stun::kSTUNPort, list.entries[0]);

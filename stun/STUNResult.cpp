@@ -173,7 +173,7 @@ void CSTUNResult::ProcessSTUNResultThread() {
                 NQ_LOG(kProcess, foundation::kLogInfo, "%s", "dwWaitRet == WAIT_TIMEOUT");
                 break;
             case platform::WaitResult::Stopped:
-                return;
+                break;
             case platform::WaitResult::Failed:
                 NQ_LOG(kProcess, foundation::kLogInfo, "dwWaitRet == 0x%x, dwErro = 0x%x",
                        kWaitFailed, 0u);
@@ -220,21 +220,15 @@ bool CSTUNResult::ClassifyLocalAddresses(STUNResultList& list) {
         if (index < 0) {
             index = 0;  // nobody answered: the first server gets the full test anyway
         }
-        if (platform::CurrentThreadStopRequested()) {
-            return false;
-        }
         char token[kServerTokenSize] = {};
         GetListToken(m_servers.c_str(), index, token, sizeof token);
         uint32_t server = 0;
         if (token[0] != '\0' && ResolveSTUNServer(token, /*logErrors=*/true, server)) {
             STUN_GetResult(server, kSTUNPort, entry);
-            if (platform::CurrentThreadStopRequested()) {
-                return false;
-            }
         }
         list.entries[i] = entry;
     }
-    return !platform::CurrentThreadStopRequested();
+    return true;
 }
 
 }  // namespace stun

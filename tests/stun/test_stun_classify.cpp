@@ -1,0 +1,106 @@
+// The classification sequence against a fake server, for the answers no real server gives, and
+// the choice of the first answering server.
+#include <gtest/gtest.h>
+
+#include <string>
+#include <vector>
+
+#include "platform/testing/process.h"
+#include "stun/STUNClassify.h"
+#include "tests/support/FakeStunServer.h"
+#include "tests/support/LogCapture.h"
+
+namespace {
+
+using testsupport::FakeStunServer;
+using testsupport::LogCapture;
+
+constexpr uint32_t kLocal = 0x7F000001;
+
+// A loopback address of this process's own, so that servers on port 3478 do not meet those of
+// parallel test processes.
+uint32_t OwnLoopback(uint8_t last) {
+    const int pid = platform::testing::CurrentProcessId();
+    return 0x7F000000u | (static_cast<uint32_t>((pid >> 8) & 0x7F) + 128u) << 16 |
+           static_cast<uint32_t>(pid & 0xFF) << 8 | last;
+}
+
+stun::STUNResultEntry Classify(const FakeStunServer& server) {
+    stun::STUNResultEntry entry;
+    entry.localAddress = kLocal;
+    entry.stunResult = 0xEE;
+    entry.publicAddress = 0;
+    stun::STUN_GetResult(server.Address(), server.Port(), entry);
+    return entry;
+}
+
+TEST(STUNGetResult, AnswerWithoutChangedAddressIsUnknownAndLogged) {
+    FakeStunServer server;
+    server.SetMode(FakeStunServer::Mode::kNoChangedAddress);
+    LogCapture log;
+    const auto entry = Classify(server);
+    EXPECT_EQ(entry.stunResult, stun::STUN_RESULT_UNKNOWN);
+    EXPECT_EQ(entry.publicAddress, stun::kNoPublicAddress);
+    EXPECT_EQ(server.RequestCount(), 1);
+    const auto lines = log.LinesOf("STUN_GetResult");
+    ASSERT_EQ(lines.size(), 1u);
+    EXPECT_EQ(lines[0].level, "ERROR");
+    EXPECT_EQ(lines[0].message, "response on test 1 doesn't have the mandatory attributes");
+}
+
+TEST(STUNGetResult, PortTranslationIsSymmetricAfterTestOneAlone) {
+    FakeStunServer server;
+    server.SetMappedPort(9);  // whatever port we use, the "NAT" shows another
+    const auto entry = Classify(server);
+    EXPECT_EQ(entry.stunResult, stun::STUN_RESULT_SYMMETRIC_NAT);
+    EXPECT_EQ(entry.publicAddress, stun::kNoPublicAddress);
+    EXPECT_EQ(server.RequestCount(), 1);
+}
+
+TEST(STUNGetResult, SilentServerIsBlockedAfterSixRequests) {
+    FakeStunServer server;
+    server.SetMode(FakeStunServer::Mode::kSilent);
+    const auto entry = Classify(server);
+    EXPECT_EQ(entry.stunResult, stun::STUN_RESULT_BLOCKED);
+    EXPECT_EQ(entry.publicAddress, stun::kNoPublicAddress);
+    EXPECT_EQ(server.RequestCount(), 6);
+}
+
+TEST(STUNTestServers, FirstSilentServerIsPassedOverForTheSecond) {
+    FakeStunServer silent(OwnLoopback(9), stun::kSTUNPort);
+    FakeStunServer answering(OwnLoopback(10), stun::kSTUNPort);
+    ASSERT_TRUE(silent.IsRunning());
+    ASSERT_TRUE(answering.IsRunning());
+    silent.SetMode(FakeStunServer::Mode::kSilent);
+    const std::string list = stun::FormatHostOrderAddress(silent.Address()) + "," +
+                             stun::FormatHostOrderAddress(answering.Address());
+    LogCapture log;
+    EXPECT_EQ(stun::STUN_TestServers(kLocal, list.c_str()), 1);
+    EXPECT_EQ(silent.RequestCount(), 6);
+    EXPECT_EQ(answering.RequestCount(), 1);
+    std::vector<std::string> messages;
+    for (const auto& line : log.LinesOf("STUN_TestServers")) {
+        messages.push_back(line.level + " " + line.message);
+    }
+    EXPECT_EQ(messages, (std::vector<std::string>{"TRACE Entered...", "ERROR STUN_RunTest() failed",
+                                                  "INFO STUN_RunTest() succeeded"}));
+}
+
+TEST(STUNTestServers, MissingOrEmptyListsGiveMinusOne) {
+    LogCapture log;
+    EXPECT_EQ(stun::STUN_TestServers(kLocal, nullptr), -1);
+    const auto lines = log.LinesOf("STUN_TestServers");
+    ASSERT_EQ(lines.size(), 1u);
+    EXPECT_EQ(lines[0].message, "Failed Assertion - szCSServers != NULL");
+    EXPECT_EQ(stun::STUN_TestServers(kLocal, ""), -1);
+    EXPECT_EQ(stun::STUN_TestServers(kLocal, ",,,"), -1);
+}
+
+TEST(STUNTestServers, AddressZeroCountsAsAFailedServer) {
+    FakeStunServer answering(OwnLoopback(11), stun::kSTUNPort);
+    ASSERT_TRUE(answering.IsRunning());
+    const std::string list = "0.0.0.0," + stun::FormatHostOrderAddress(answering.Address());
+    EXPECT_EQ(stun::STUN_TestServers(kLocal, list.c_str()), 1);
+}
+
+}  // namespace

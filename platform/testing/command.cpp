@@ -63,3 +63,13 @@ int RunCommand(const std::vector<std::string>& argv, std::string* output) {
 }
 
 }  // namespace platform::testing
+
+namespace platform::testing {
+
+std::string CurrentExecutable() {
+    char path[4096];
+    const ssize_t n = readlink("/proc/self/exe", path, sizeof path - 1);
+    return n > 0 ? std::string(path, static_cast<size_t>(n)) : std::string();
+}
+
+}  // namespace platform::testing

@@ -12,3 +12,10 @@ namespace platform::testing {
 int RunCommand(const std::vector<std::string>& argv, std::string* output = nullptr);
 
 }  // namespace platform::testing
+
+namespace platform::testing {
+
+// The path of the running executable, so a test can run itself somewhere else.
+std::string CurrentExecutable();
+
+}  // namespace platform::testing

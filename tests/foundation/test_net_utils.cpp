@@ -11,7 +11,9 @@
 #include "platform/kernel.h"
 #include "platform/net.h"
 #include "platform/netinfo.h"
+#include "tests/support/DnsLab.h"
 #include "tests/support/FakeNetworkInfo.h"
+#include "tests/support/LogCapture.h"
 
 namespace {
 
@@ -270,6 +272,32 @@ TEST(SystemNetworkInfo, LoopbackIsListedWithoutAGateway) {
         }
     }
     EXPECT_TRUE(sawLoopback);
+}
+
+}  // namespace
+
+namespace {
+
+// Name look-ups against a name server of the test's own: the outer test builds the lab and runs
+// itself inside it, where the body does the checking.
+#define NQPM_RUN_INSIDE_DNS_LAB(suite, name)         \
+    if (!testsupport::DnsLab::InsideDnsLab()) {      \
+        testsupport::DnsLab lab;                     \
+        std::string why;                             \
+        if (!lab.Up(&why)) {                         \
+            GTEST_SKIP() << why;                     \
+        }                                            \
+        EXPECT_EQ(lab.RunSelf(#suite "." #name), 0); \
+        return;                                      \
+    }
+
+TEST(LabDns, UnknownNameGivesEachVariantsNotFoundValueWithoutLogging) {
+    NQPM_RUN_INSIDE_DNS_LAB(LabDns, UnknownNameGivesEachVariantsNotFoundValueWithoutLogging)
+    testsupport::LogCapture log;
+    EXPECT_EQ(platform::NetToHost32(GetIPByName(testsupport::DnsLab::kKnownName)), kLoopback);
+    EXPECT_EQ(GetIPByName(testsupport::DnsLab::kUnknownName), 0u);
+    EXPECT_EQ(GetIPByName(testsupport::DnsLab::kUnknownName, kAddressNone), kAddressNone);
+    EXPECT_TRUE(log.Lines().empty());
 }
 
 }  // namespace

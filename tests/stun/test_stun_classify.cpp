@@ -7,6 +7,7 @@
 
 #include "platform/testing/process.h"
 #include "stun/STUNClassify.h"
+#include "tests/support/DnsLab.h"
 #include "tests/support/FakeStunServer.h"
 #include "tests/support/LogCapture.h"
 
@@ -101,6 +102,30 @@ TEST(STUNTestServers, AddressZeroCountsAsAFailedServer) {
     ASSERT_TRUE(answering.IsRunning());
     const std::string list = "0.0.0.0," + stun::FormatHostOrderAddress(answering.Address());
     EXPECT_EQ(stun::STUN_TestServers(kLocal, list.c_str()), 1);
+}
+
+}  // namespace
+
+namespace {
+
+TEST(LabDnsTestServers, UnresolvableNamesAreSkippedAndOnlyThoseGiveMinusOne) {
+    if (!testsupport::DnsLab::InsideDnsLab()) {
+        testsupport::DnsLab lab;
+        std::string why;
+        if (!lab.Up(&why)) {
+            GTEST_SKIP() << why;
+        }
+        EXPECT_EQ(lab.RunSelf("LabDnsTestServers.*"), 0);
+        return;
+    }
+    const std::string unknown = testsupport::DnsLab::kUnknownName;
+    EXPECT_EQ(stun::STUN_TestServers(kLocal, (unknown + "," + unknown).c_str()), -1);
+    // stun.lab.test is 127.0.0.1: a server there on 3478 is chosen after the unknown name.
+    FakeStunServer answering(kLocal, stun::kSTUNPort);
+    ASSERT_TRUE(answering.IsRunning());
+    const std::string list = unknown + "," + testsupport::DnsLab::kKnownName;
+    EXPECT_EQ(stun::STUN_TestServers(kLocal, list.c_str()), 1);
+    EXPECT_EQ(answering.RequestCount(), 1);
 }
 
 }  // namespace

@@ -1,0 +1,77 @@
+#include "tests/support/DnsLab.h"
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+
+#include "platform/kernel.h"
+#include "platform/testing/command.h"
+#include "platform/testing/netns.h"
+
+namespace testsupport {
+
+namespace {
+constexpr const char* kInsideVariable = "NQPM_INSIDE_DNS_LAB";
+}
+
+DnsLab::DnsLab() : name_("nqdns" + std::to_string(platform::testing::CurrentProcessId())) {}
+
+DnsLab::~DnsLab() {
+    dnsmasq_.Stop();
+    if (created_) {
+        platform::testing::RunCommand({"ip", "netns", "delete", name_});
+        std::error_code ignored;
+        std::filesystem::remove_all("/etc/netns/" + name_, ignored);
+    }
+    std::error_code ignored;
+    std::filesystem::remove("/tmp/" + name_ + "-dnsmasq.log", ignored);
+}
+
+bool DnsLab::InsideDnsLab() {
+    return std::getenv(kInsideVariable) != nullptr;
+}
+
+bool DnsLab::Up(std::string* why) {
+    if (!platform::testing::IsRoot() || platform::testing::FindExecutable("dnsmasq").empty()) {
+        *why = "needs root and dnsmasq";
+        return false;
+    }
+    if (platform::testing::RunCommand({"ip", "netns", "add", name_}) != 0) {
+        *why = "cannot create a network namespace";
+        return false;
+    }
+    created_ = true;
+    platform::testing::RunCommand({"ip", "-n", name_, "link", "set", "lo", "up"});
+    // `ip netns exec` shows this file as /etc/resolv.conf inside the namespace.
+    std::filesystem::create_directories("/etc/netns/" + name_);
+    std::ofstream("/etc/netns/" + name_ + "/resolv.conf") << "nameserver 127.0.0.1\n";
+    const std::string log = "/tmp/" + name_ + "-dnsmasq.log";
+    if (!dnsmasq_.Start(
+            {"ip", "netns", "exec", name_, "dnsmasq", "--keep-in-foreground", "--no-resolv",
+             "--no-hosts", "--bind-interfaces", "--listen-address=127.0.0.1", "--local=/lab.test/",
+             std::string("--host-record=") + kKnownName + ",127.0.0.1",
+             "--pid-file=", "--user=root"},
+            log)) {
+        *why = "dnsmasq did not start";
+        return false;
+    }
+    for (int attempt = 0; attempt < 50; ++attempt) {
+        std::string listening;
+        platform::testing::RunCommand(
+            {"ip", "netns", "exec", name_, "ss", "-Hlun", "sport", "=", ":53"}, &listening);
+        if (listening.find("127.0.0.1:53") != std::string::npos) {
+            return true;
+        }
+        platform::Sleep(100);
+    }
+    *why = "dnsmasq does not answer";
+    return false;
+}
+
+int DnsLab::RunSelf(const std::string& testName) const {
+    return platform::testing::RunCommand(
+        {"ip", "netns", "exec", name_, "env", std::string(kInsideVariable) + "=1",
+         platform::testing::CurrentExecutable(), "--gtest_filter=" + testName});
+}
+
+}  // namespace testsupport

@@ -1,0 +1,37 @@
+// A network namespace with its own name server (dnsmasq on 127.0.0.1) that knows
+// stun.lab.test and answers "no such name" for everything else below lab.test, so that name
+// look-ups can be tested without any traffic leaving the machine. Tests run inside it by running
+// their own executable there: RunSelf() with the test's name, and InsideDnsLab() in the child.
+#pragma once
+
+#include <string>
+
+#include "platform/testing/process.h"
+
+namespace testsupport {
+
+class DnsLab {
+  public:
+    static constexpr const char* kKnownName = "stun.lab.test";  // resolves to 127.0.0.1
+    static constexpr const char* kUnknownName = "no-such-host.lab.test";
+
+    DnsLab();
+    ~DnsLab();
+    DnsLab(const DnsLab&) = delete;
+    DnsLab& operator=(const DnsLab&) = delete;
+
+    // False (and a GTEST skip reason in *why) when the lab cannot be built here.
+    bool Up(std::string* why);
+    // Runs this test executable inside the namespace with only the given test; its exit code.
+    int RunSelf(const std::string& testName) const;
+
+    // True in the child that RunSelf started.
+    static bool InsideDnsLab();
+
+  private:
+    std::string name_;
+    platform::testing::Process dnsmasq_;
+    bool created_ = false;
+};
+
+}  // namespace testsupport

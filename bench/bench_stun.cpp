@@ -8,23 +8,12 @@
 
 #include "foundation/Logger.h"
 #include "stun/STUNMessage.h"
+#include "tests/support/StunBytes.h"
 
 namespace {
 
-void Put16(std::vector<uint8_t>& out, uint16_t v) {
-    out.push_back(static_cast<uint8_t>(v >> 8));
-    out.push_back(static_cast<uint8_t>(v));
-}
-
-void PutAddress(std::vector<uint8_t>& out, uint16_t type, uint32_t address, uint16_t port) {
-    Put16(out, type);
-    Put16(out, 8);
-    out.push_back(0);
-    out.push_back(1);
-    Put16(out, port);
-    Put16(out, static_cast<uint16_t>(address >> 16));
-    Put16(out, static_cast<uint16_t>(address));
-}
+using testsupport::Put16;
+using testsupport::PutAddress;
 
 // MAPPED, SOURCE, CHANGED, the old XOR-MAPPED (0x0020) and SERVER, as stund 0.97 sends them.
 std::vector<uint8_t> StundResponse() {

@@ -4,6 +4,7 @@
 
 #include <string>
 
+#include "tests/support/JsonField.h"
 #include "tests/support/NatLab.h"
 
 namespace {
@@ -30,18 +31,7 @@ const Expectation kBehaviours[] = {
 constexpr const char* kSipProxy = "sip.example.net:5060";
 constexpr const char* kMediaProxy = "media.example.net";
 
-std::string JsonField(const std::string& json, const std::string& key) {
-    const std::string tag = "\"" + key + "\":";
-    const auto at = json.find(tag);
-    if (at == std::string::npos) {
-        return "<missing>";
-    }
-    const auto start = at + tag.size();
-    if (json[start] == '"') {
-        return json.substr(start + 1, json.find('"', start + 1) - start - 1);
-    }
-    return json.substr(start, json.find_first_of(",}", start) - start);
-}
+using testsupport::JsonField;
 
 std::string Discover(const testsupport::NatLab& lab) {
     std::string out;

@@ -8,6 +8,7 @@
 
 #include "platform/testing/command.h"
 
+#include "tests/support/JsonField.h"
 #include "tests/support/NatLab.h"
 
 namespace {
@@ -31,23 +32,7 @@ const Expectation kBehaviours[] = {
 };
 
 // The value of "key": in a flat JSON text (strings unquoted; null stays null).
-std::string JsonField(const std::string& json, const std::string& key) {
-    const std::string tag = "\"" + key + "\":";
-    const auto at = json.find(tag);
-    if (at == std::string::npos) {
-        return "<missing>";
-    }
-    auto start = at + tag.size();
-    if (json.compare(start, 4, "null") == 0) {
-        return "null";
-    }
-    if (json[start] == '"') {
-        const auto end = json.find('"', start + 1);
-        return json.substr(start + 1, end - start - 1);
-    }
-    const auto end = json.find_first_of(",}", start);
-    return json.substr(start, end - start);
-}
+using testsupport::JsonField;
 
 class LabClassify : public ::testing::TestWithParam<int> {};
 

@@ -4,6 +4,8 @@
 #include <chrono>
 #include <utility>
 
+#include "tests/support/StunBytes.h"
+
 namespace testsupport {
 
 namespace {
@@ -18,21 +20,6 @@ uint16_t Read16(const uint8_t* p) {
 uint32_t Read32(const uint8_t* p) {
     return (static_cast<uint32_t>(p[0]) << 24) | (static_cast<uint32_t>(p[1]) << 16) |
            (static_cast<uint32_t>(p[2]) << 8) | p[3];
-}
-
-void Put16(std::vector<uint8_t>& out, uint16_t v) {
-    out.push_back(static_cast<uint8_t>(v >> 8));
-    out.push_back(static_cast<uint8_t>(v));
-}
-
-void PutAddress(std::vector<uint8_t>& out, uint16_t type, uint32_t address, uint16_t port) {
-    Put16(out, type);
-    Put16(out, 8);
-    out.push_back(0);
-    out.push_back(1);
-    Put16(out, port);
-    Put16(out, static_cast<uint16_t>(address >> 16));
-    Put16(out, static_cast<uint16_t>(address));
 }
 
 // The RESPONSE-ADDRESS of a request, parsed independently of the code under test.
@@ -209,6 +196,7 @@ std::vector<uint8_t> FakeStunServer::BuildResponse(const Request& request,
                                                    uint32_t fromAddress, uint16_t fromPort,
                                                    bool reflected) const {
     std::vector<uint8_t> out;
+    out.reserve(64);  // also keeps GCC 12 from a false overflow warning on the insert below
     Put16(out, kBindingResponse);
     Put16(out, 0);  // patched below
     out.insert(out.end(), transactionId, transactionId + 16);

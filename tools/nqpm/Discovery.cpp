@@ -172,49 +172,48 @@ void Discovery::PumpFor(double seconds) {
                                   seconds < 0 ? -1 : static_cast<int>(seconds * 1000));
 }
 
-std::string Discovery::ReportText() const {
-    PM_STATE state{};
-    PM_TOPOLOGY topology{};
+Discovery::Report Discovery::Read() const {
+    Report r;
     VARIANT_BOOL upnp = VARIANT_FALSE;
-    m_pm->get_State(&state);
-    m_pm->get_Topology(&topology);
+    m_pm->get_State(&r.state);
+    m_pm->get_Topology(&r.topology);
     m_pm->get_RecommendedUpnpEnabled(&upnp);
+    r.upnp = upnp != VARIANT_FALSE;
+    r.privateAddress = Text(&IAdvancedPortManager::get_PrivateIpAddress, m_pm);
+    r.publicAddress = Text(&IAdvancedPortManager::get_PublicIpAddress, m_pm);
+    r.sipServer = Text(&IAdvancedPortManager::get_RecommendedSipServer, m_pm);
+    r.suffix = Text(&IAdvancedPortManager::get_ClientNameSuffix, m_pm);
+    r.portManager = PortManagerRecommended(m_pm);
+    return r;
+}
+
+std::string Discovery::ReportText() const {
+    const Report r = Read();
     std::string out;
-    out += std::string("state:                    ") + StateName(state) + "\n";
-    out += std::string("topology:                 ") + TopologyName(topology) + " (" +
-           std::to_string(topology) + ")\n";
-    out += "private address:          " + Text(&IAdvancedPortManager::get_PrivateIpAddress, m_pm) +
-           "\n";
-    out += "public address:           " + Text(&IAdvancedPortManager::get_PublicIpAddress, m_pm) +
-           "\n";
-    out +=
-        "recommended SIP server:   " + Text(&IAdvancedPortManager::get_RecommendedSipServer, m_pm) +
-        "\n";
-    out += std::string("recommended UPnP enabled: ") + (upnp ? "yes" : "no") + "\n";
-    out += "client name suffix:       " + Text(&IAdvancedPortManager::get_ClientNameSuffix, m_pm) +
-           "\n";
-    out += std::string("port manager recommended: ") +
-           (PortManagerRecommended(m_pm) ? "yes" : "no") + "\n";
+    out += std::string("state:                    ") + StateName(r.state) + "\n";
+    out += std::string("topology:                 ") + TopologyName(r.topology) + " (" +
+           std::to_string(r.topology) + ")\n";
+    out += "private address:          " + r.privateAddress + "\n";
+    out += "public address:           " + r.publicAddress + "\n";
+    out += "recommended SIP server:   " + r.sipServer + "\n";
+    out += std::string("recommended UPnP enabled: ") + (r.upnp ? "yes" : "no") + "\n";
+    out += "client name suffix:       " + r.suffix + "\n";
+    out += std::string("port manager recommended: ") + (r.portManager ? "yes" : "no") + "\n";
     return out;
 }
 
 std::string Discovery::ReportJson() const {
-    PM_STATE state{};
-    PM_TOPOLOGY topology{};
-    VARIANT_BOOL upnp = VARIANT_FALSE;
-    m_pm->get_State(&state);
-    m_pm->get_Topology(&topology);
-    m_pm->get_RecommendedUpnpEnabled(&upnp);
+    const Report r = Read();
     JsonObject o;
-    o.Add("state", StateName(state))
-        .Add("topology", TopologyName(topology))
-        .Add("topology_code", static_cast<int64_t>(topology))
-        .Add("private", Text(&IAdvancedPortManager::get_PrivateIpAddress, m_pm))
-        .Add("public", Text(&IAdvancedPortManager::get_PublicIpAddress, m_pm))
-        .Add("recommended_sip_server", Text(&IAdvancedPortManager::get_RecommendedSipServer, m_pm))
-        .Add("recommended_upnp_enabled", upnp != VARIANT_FALSE)
-        .Add("client_name_suffix", Text(&IAdvancedPortManager::get_ClientNameSuffix, m_pm))
-        .Add("recommended_port_manager", PortManagerRecommended(m_pm));
+    o.Add("state", StateName(r.state))
+        .Add("topology", TopologyName(r.topology))
+        .Add("topology_code", static_cast<int64_t>(r.topology))
+        .Add("private", r.privateAddress)
+        .Add("public", r.publicAddress)
+        .Add("recommended_sip_server", r.sipServer)
+        .Add("recommended_upnp_enabled", r.upnp)
+        .Add("client_name_suffix", r.suffix)
+        .Add("recommended_port_manager", r.portManager);
     return o.Str();
 }
 

@@ -55,6 +55,18 @@ class Discovery final : public _IAdvancedPortManagerEvents {
     HRESULT Event(PM_EVENT type, IDispatch* event) override;
 
   private:
+    struct Report {
+        PM_STATE state = PMS_UNINITIALIZED;
+        PM_TOPOLOGY topology = PMT_UNKNOWN;
+        std::string privateAddress;
+        std::string publicAddress;
+        std::string sipServer;
+        std::string suffix;
+        bool upnp = false;
+        bool portManager = false;
+    };
+    Report Read() const;
+
     IAdvancedPortManager* m_pm = nullptr;
     DWORD m_cookie = 0;
     int m_events[4] = {0, 0, 0, 0};

@@ -125,6 +125,12 @@ void CNetworkChangeMonitor::MonitorThread() {
             }
         }
         const platform::NetworkChanges changes = m_watcher->Read();
+        if (changes.failed) {
+            // A broken socket stays readable: waiting on it again would spin.
+            NQ_LOG("CNetworkChangeMonitor::MonitorThread", kLogError, "%s",
+                   "Reading address and route changes failed");
+            return;
+        }
         addressPending = addressPending || changes.addresses;
         routePending = routePending || changes.routes;
         // Addresses first; a pending route change is served on the next turn.

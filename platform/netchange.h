@@ -10,6 +10,7 @@ namespace platform {
 struct NetworkChanges {
     bool addresses = false;  // an IPv4 address was added or removed
     bool routes = false;     // an IPv4 route was added or removed
+    bool failed = false;     // the socket broke (not just an overflow): nothing more will come
 };
 
 // Subscribes to the kernel's IPv4 address and route notifications at construction and owns

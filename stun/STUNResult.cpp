@@ -69,13 +69,14 @@ HRESULT CSTUNResult::Refresh() {
 }
 
 void CSTUNResult::RefreshResults() {
+    NQ_TRACE_ENTERED("CSTUNResult::RefreshResults");
+    std::lock_guard<std::mutex> lifecycle(m_lifecycle);
     {
         platform::CriticalSectionLock lock(m_lock);
         m_ready = false;
         ++m_refreshCount;
+        m_passAwaited = m_refreshEvent != nullptr;
     }
-    NQ_TRACE_ENTERED("CSTUNResult::RefreshResults");
-    std::lock_guard<std::mutex> lifecycle(m_lifecycle);
     if (m_refreshEvent) {
         m_refreshEvent->Set();
     }
@@ -89,6 +90,9 @@ void CSTUNResult::Stop() {
     // The thread's waits and transactions end on the stop request; neither lock is held here.
     m_thread.Stop();
     m_refreshEvent.reset();
+    // A pass that was asked for is cancelled: nobody may wait for it any more.
+    platform::CriticalSectionLock lock(m_lock);
+    m_passAwaited = false;
 }
 
 bool CSTUNResult::IsRunning() {
@@ -115,14 +119,17 @@ bool CSTUNResult::GetSTUNResult(STUNResultList* result) {
     }
     Start();
     for (;;) {
+        // Waiting only makes sense while a pass that will set the flag is queued or running.
         {
             platform::CriticalSectionLock lock(m_lock);
             if (m_ready) {
                 break;
             }
+            if (!m_passAwaited) {
+                return false;
+            }
         }
         {
-            // Nobody would ever set the flag: give up instead of waiting forever.
             std::lock_guard<std::mutex> lifecycle(m_lifecycle);
             if (!m_thread.IsStarted() || m_thread.HasFinished()) {
                 return false;
@@ -173,7 +180,7 @@ void CSTUNResult::ProcessSTUNResultThread() {
                 NQ_LOG(kProcess, foundation::kLogInfo, "%s", "dwWaitRet == WAIT_TIMEOUT");
                 break;
             case platform::WaitResult::Stopped:
-                break;
+                return;
             case platform::WaitResult::Failed:
                 NQ_LOG(kProcess, foundation::kLogInfo, "dwWaitRet == 0x%x, dwErro = 0x%x",
                        kWaitFailed, 0u);
@@ -194,6 +201,7 @@ void CSTUNResult::ProcessSTUNResultThread() {
             m_results = list;
             // A Refresh during the pass wants the pass after it.
             m_ready = refreshCount == m_refreshCount;
+            m_passAwaited = m_passAwaited && !m_ready;
             text = FormatSTUNResults(m_results);
         }
         platform::PostMessage(m_window, m_message, m_wParam, 0);
@@ -220,15 +228,21 @@ bool CSTUNResult::ClassifyLocalAddresses(STUNResultList& list) {
         if (index < 0) {
             index = 0;  // nobody answered: the first server gets the full test anyway
         }
+        if (platform::CurrentThreadStopRequested()) {
+            return false;
+        }
         char token[kServerTokenSize] = {};
         GetListToken(m_servers.c_str(), index, token, sizeof token);
         uint32_t server = 0;
         if (token[0] != '\0' && ResolveSTUNServer(token, /*logErrors=*/true, server)) {
             STUN_GetResult(server, kSTUNPort, entry);
+            if (platform::CurrentThreadStopRequested()) {
+                return false;
+            }
         }
         list.entries[i] = entry;
     }
-    return true;
+    return !platform::CurrentThreadStopRequested();
 }
 
 }  // namespace stun

@@ -27,8 +27,9 @@ class ISTUNResult {
     virtual bool IsRunning() = 0;
     virtual bool IsSTUNResultReady() = 0;
     // Waits (polling every second) until a pass has stored results, then copies them. True with
-    // the copy; false, copying nothing, when result is null or the wait was abandoned because
-    // the service stopped (or its thread ended, or the calling thread was asked to stop).
+    // the copy. False, copying nothing, when result is null or no pass that would end the wait
+    // is asked for (none was, or Stop cancelled it), or the service's or the calling thread
+    // ended.
     virtual bool GetSTUNResult(STUNResultList* result) = 0;
     virtual ~ISTUNResult() = default;
     // Creates the refresh event and the service thread and starts the monitor; S_OK when
@@ -71,6 +72,7 @@ class CSTUNResult : public ISTUNResult, public foundation::INetworkChangeSink {
     platform::CriticalSection m_lock;  // the three fields below; never held during traffic
     bool m_ready = false;
     uint64_t m_refreshCount = 0;  // Refresh calls so far: a pass is current only if none came
+    bool m_passAwaited = false;   // a Refresh is not yet answered by a current pass
     STUNResultList m_results;
 
     std::string m_servers;

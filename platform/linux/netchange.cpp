@@ -92,12 +92,14 @@ NetworkChanges NetworkChangeWatcher::Read() {
                 changes.addresses = changes.routes = true;
                 continue;
             }
-            return changes;  // EAGAIN: drained
+            changes.failed = errno != EAGAIN && errno != EWOULDBLOCK;
+            return changes;
         }
-        // Only the kernel speaks on these groups; a cut datagram may hide either kind.
+        // Only the kernel may speak on these groups.
         if (sender.nl_pid != 0) {
             continue;
         }
+        // A cut datagram may hide either kind.
         if ((message.msg_flags & MSG_TRUNC) != 0) {
             changes.addresses = changes.routes = true;
             continue;

@@ -41,29 +41,21 @@ int64_t MsSince(Clock::time_point start) {
 
 // ---- Which addresses count, and the lifecycle (network-information double) -----------------
 
-struct FakeAdapter {
-    uint32_t index;
-    std::vector<uint32_t> addresses;  // primary first
-    std::string gateway;
-};
-
 // Interfaces as the test describes them, changeable while the monitor's thread reads them. The
-// address table lists the rows in the order given, which need not be the adapters' order, and
-// either query can fail on its own. Counts the table queries made on the test's thread.
+// address table lists its rows in the order given, which need not be the adapters' order.
+// Counts the table queries made on the test's thread.
 class ScriptedNetworkInfo : public platform::NetworkInfo {
   public:
     ScriptedNetworkInfo() { platform::InstallNetworkInfo(this); }
     ~ScriptedNetworkInfo() override { platform::InstallNetworkInfo(nullptr); }
 
-    void Set(std::vector<FakeAdapter> adapters, std::vector<platform::AddressRow> table) {
+    void Set(std::vector<platform::AdapterInfo> adapters, std::vector<uint32_t> table,
+             bool tableOk = true, bool adaptersOk = true) {
         std::lock_guard<std::mutex> lock(mutex_);
         adapters_ = std::move(adapters);
         table_ = std::move(table);
-    }
-    void SetFailing(bool table, bool adapters) {
-        std::lock_guard<std::mutex> lock(mutex_);
-        failTable_ = table;
-        failAdapters_ = adapters;
+        tableOk_ = tableOk;
+        adaptersOk_ = adaptersOk;
     }
     int TableQueriesOnTestThread() const {
         std::lock_guard<std::mutex> lock(mutex_);
@@ -72,33 +64,17 @@ class ScriptedNetworkInfo : public platform::NetworkInfo {
 
     bool Adapters(std::vector<platform::AdapterInfo>& out) override {
         std::lock_guard<std::mutex> lock(mutex_);
-        out.clear();
-        if (failAdapters_) {
-            return false;
-        }
-        for (const auto& a : adapters_) {
-            platform::AdapterInfo info;
-            info.index = a.index;
-            info.name = "if" + std::to_string(a.index);
-            for (uint32_t address : a.addresses) {
-                info.addresses.push_back(foundation::FormatHostAddress(address));
-            }
-            info.gateway = a.gateway;
-            out.push_back(info);
-        }
-        return true;
+        out = adaptersOk_ ? adapters_ : std::vector<platform::AdapterInfo>{};
+        return adaptersOk_;
     }
     bool AddressTable(std::vector<platform::AddressRow>& out) override {
         std::lock_guard<std::mutex> lock(mutex_);
-        if (std::this_thread::get_id() == testThread_) {
-            ++testThreadQueries_;
-        }
+        testThreadQueries_ += std::this_thread::get_id() == testThread_ ? 1 : 0;
         out.clear();
-        if (failTable_) {
-            return false;
+        for (uint32_t address : table_) {
+            out.push_back({address, 0});  // the monitor never looks at the index
         }
-        out = table_;
-        return true;
+        return tableOk_;
     }
     int UdpInDatagrams(uint32_t& count) override {
         count = 0;
@@ -107,62 +83,48 @@ class ScriptedNetworkInfo : public platform::NetworkInfo {
 
   private:
     mutable std::mutex mutex_;
-    std::vector<FakeAdapter> adapters_;
-    std::vector<platform::AddressRow> table_;
-    bool failTable_ = false;
-    bool failAdapters_ = false;
+    std::vector<platform::AdapterInfo> adapters_;
+    std::vector<uint32_t> table_;
+    bool tableOk_ = true;
+    bool adaptersOk_ = true;
     const std::thread::id testThread_ = std::this_thread::get_id();
     int testThreadQueries_ = 0;
 };
 
 // One interface whose only address has a gateway.
-void SetSingleHost(ScriptedNetworkInfo& info, uint32_t address) {
-    info.Set({{2, {address}, "198.51.100.1"}}, {{address, 2}});
+void SetSingleHost(ScriptedNetworkInfo& info, uint32_t address, bool tableOk = true,
+                   bool adaptersOk = true) {
+    info.Set({{2, "eth0", {foundation::FormatHostAddress(address)}, "198.51.100.1"}}, {address},
+             tableOk, adaptersOk);
 }
 
 TEST(NetworkChangeMonitor, ListsTheFirstAddressOfEachInterfaceWithAGatewayInTableOrder) {
     ScriptedNetworkInfo info;
-    const uint32_t eth1 = Ip(10, 0, 0, 5), eth1Second = Ip(10, 0, 0, 6);
-    const uint32_t noGateway = Ip(192, 168, 1, 7), eth3 = Ip(172, 16, 0, 9);
-    const uint32_t loopback = Ip(127, 0, 0, 1), otherLoopback = Ip(127, 0, 0, 5);
-    const uint32_t any = 0, broadcast = 0xFFFFFFFF;
     // Every excluded address but the secondary one heads an adapter with a gateway, so that
     // only the rule under test can keep it out.
-    info.Set(
-        {
-            {2, {eth1, eth1Second}, "10.0.0.1"},
-            {3, {noGateway}, ""},
-            {4, {eth3}, "172.16.0.1"},
-            {1, {loopback}, "127.0.0.254"},
-            {5, {otherLoopback}, "127.0.0.254"},
-            {6, {any}, "10.0.0.1"},
-            {7, {broadcast}, "10.0.0.1"},
-        },
-        {{eth3, 4},
-         {any, 6},
-         {loopback, 1},
-         {eth1, 2},
-         {eth1Second, 2},
-         {noGateway, 3},
-         {broadcast, 7},
-         {otherLoopback, 5}});
+    info.Set({{2, "eth1", {"10.0.0.5", "10.0.0.6"}, "10.0.0.1"},
+              {3, "eth2", {"192.168.1.7"}, ""},
+              {4, "eth3", {"172.16.0.9"}, "172.16.0.1"},
+              {1, "lo", {"127.0.0.1"}, "127.0.0.254"},
+              {5, "lo5", {"127.0.0.5"}, "127.0.0.254"},
+              {6, "any", {"0.0.0.0"}, "10.0.0.1"},
+              {7, "bcast", {"255.255.255.255"}, "10.0.0.1"}},
+             {Ip(172, 16, 0, 9), 0, Ip(127, 0, 0, 1), Ip(10, 0, 0, 5), Ip(10, 0, 0, 6),
+              Ip(192, 168, 1, 7), 0xFFFFFFFF, Ip(127, 0, 0, 5)});
     CNetworkChangeMonitor monitor;
     EXPECT_TRUE(monitor.GetLocalIPs().empty());
     monitor.RefreshLocalIPs();
-    EXPECT_EQ(monitor.GetLocalIPs(), (Addresses{eth3, eth1, otherLoopback}));
-}
+    EXPECT_EQ(monitor.GetLocalIPs(),
+              (Addresses{Ip(172, 16, 0, 9), Ip(10, 0, 0, 5), Ip(127, 0, 0, 5)}));
 
-TEST(NetworkChangeMonitor, AFailedQueryEmptiesTheList) {
-    ScriptedNetworkInfo info;
-    SetSingleHost(info, Ip(10, 0, 0, 5));
-    CNetworkChangeMonitor monitor;
-    for (const auto& [table, adapters] : {std::pair{true, false}, std::pair{false, true}}) {
-        info.SetFailing(false, false);
+    // A failed query of either kind leaves nothing listed.
+    for (const auto& [tableOk, adaptersOk] : {std::pair{false, true}, std::pair{true, false}}) {
+        SetSingleHost(info, Ip(10, 0, 0, 5));
         monitor.RefreshLocalIPs();
         ASSERT_EQ(monitor.GetLocalIPs(), Addresses{Ip(10, 0, 0, 5)});
-        info.SetFailing(table, adapters);
+        SetSingleHost(info, Ip(10, 0, 0, 5), tableOk, adaptersOk);
         monitor.RefreshLocalIPs();
-        EXPECT_TRUE(monitor.GetLocalIPs().empty()) << "table fails " << table;
+        EXPECT_TRUE(monitor.GetLocalIPs().empty()) << "table query ok: " << tableOk;
     }
 }
 

@@ -224,25 +224,34 @@ TEST(STUNResult, StopInsideATransactionEndsThePassAtOnceWithoutResultOrLeak) {
     EXPECT_EQ(platform::CountOpenDescriptors(), descriptors);
 }
 
-TEST(STUNResult, GetSTUNResultGivesUpWhenTheServiceIsStopped) {
+TEST(STUNResult, GetSTUNResultWaitsOnlyForAPassThatWasAskedFor) {
     LocalAddresses local({kLocal});
-    CSTUNResult service("127.0.0.1", nullptr, kMessage, kWParam);
-    ASSERT_EQ(service.Start(), S_OK);  // running, but nobody asks for a pass
-    std::atomic<int> outcome{-1};      // 1 copied, 0 gave up without copying
+    auto fake = StartFakeOn3478();
+    ASSERT_NE(fake, nullptr);
+    fake->SetMode(FakeStunServer::Mode::kSilent);
+    CSTUNResult service(Text(fake->Address()).c_str(), nullptr, kMessage, kWParam);
+    STUNResultList untouched;
+    untouched.count = 77;
+    EXPECT_FALSE(service.GetSTUNResult(nullptr));
+    EXPECT_FALSE(service.GetSTUNResult(&untouched)) << "no Refresh: nothing to wait for";
+    EXPECT_TRUE(service.IsRunning());
+
+    ASSERT_EQ(service.Refresh(), S_OK);
+    ASSERT_TRUE(fake->WaitForRequests(1, 5000));  // the pass now waits for an answer
+    std::atomic<int> outcome{-1};                 // 1 copied, 0 gave up without copying
     std::thread reader([&] {
-        STUNResultList list;
-        list.count = 77;
+        STUNResultList list = untouched;
         const bool copied = service.GetSTUNResult(&list);
         outcome = copied ? 1 : (list.count == 77 ? 0 : 2);
     });
     std::this_thread::sleep_for(std::chrono::milliseconds(300));
-    EXPECT_EQ(outcome.load(), -1) << "returned without a result";
+    EXPECT_EQ(outcome.load(), -1) << "returned while the pass ran";
     const auto stopping = Clock::now();
     service.Stop();
     reader.join();
     EXPECT_EQ(outcome.load(), 0);
     EXPECT_LT(MsSince(stopping), CSTUNResult::kPollMs + 500);
-    EXPECT_FALSE(service.GetSTUNResult(nullptr));
+    EXPECT_EQ(untouched.count, 77);
 }
 
 }  // namespace

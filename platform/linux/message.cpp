@@ -141,7 +141,7 @@ class Queue {
     }
 
     void RearmLocked() {
-        itimerspec spec{};
+        itimerspec when{};
         if (!timers_.empty()) {
             uint64_t earliest = timers_.front().due;
             for (const auto& t : timers_) {
@@ -149,10 +149,10 @@ class Queue {
             }
             // Absolute monotonic time; zero would disarm, so never pass it.
             const uint64_t at = std::max<uint64_t>(earliest, 1);
-            spec.it_value.tv_sec = static_cast<time_t>(at / 1000);
-            spec.it_value.tv_nsec = static_cast<long>((at % 1000) * 1000000);
+            when.it_value.tv_sec = static_cast<time_t>(at / 1000);
+            when.it_value.tv_nsec = static_cast<long>((at % 1000) * 1000000);
         }
-        timerfd_settime(timerFd_, TFD_TIMER_ABSTIME, &spec, nullptr);
+        timerfd_settime(timerFd_, TFD_TIMER_ABSTIME, &when, nullptr);
     }
 
     std::mutex mutex_;

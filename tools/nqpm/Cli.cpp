@@ -34,17 +34,17 @@ void Options::Parse(int argc, char** argv) {
             inlineValue = name.substr(eq + 1);
             name.resize(eq);
         }
-        const OptionSpec* spec = nullptr;
+        const OptionSpec* option = nullptr;
         for (const auto& s : specs_) {
             if (s.name == name) {
-                spec = &s;
+                option = &s;
             }
         }
-        if (spec == nullptr) {
+        if (option == nullptr) {
             throw UsageError("unknown option --" + name);
         }
         std::string value;
-        if (spec->takesValue) {
+        if (option->takesValue) {
             if (inlineValue) {
                 value = *inlineValue;
             } else if (i + 1 < argc) {
@@ -56,7 +56,7 @@ void Options::Parse(int argc, char** argv) {
             throw UsageError("option --" + name + " takes no value");
         }
         auto& list = values_[name];
-        if (!list.empty() && spec->takesValue && !spec->repeatable) {
+        if (!list.empty() && option->takesValue && !option->repeatable) {
             throw UsageError("option --" + name + " given twice");
         }
         list.push_back(value);

@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <deque>
 #include <memory>
 #include <string>
@@ -10,6 +11,7 @@
 #include "portmanager/AdvancedPortManager.h"
 #include "portmanager/PortManagerUpdateEvent.h"
 #include "tests/support/FakeNetworkInfo.h"
+#include "tests/support/LogCapture.h"
 #include "tests/support/PortManagerDoubles.h"
 
 namespace {
@@ -45,26 +47,15 @@ class PortManager : public ::testing::Test {
         ASSERT_TRUE(
             platform::RunMessageLoopUntil([&] { return sink.received.size() >= count; }, 5000));
     }
-    std::string Private() {
+    std::string Text(HRESULT (IAdvancedPortManager::*getter)(BSTR*)) {
         BSTR s = nullptr;
-        EXPECT_EQ(H().pm->get_PrivateIpAddress(&s), S_OK);
+        EXPECT_EQ((H().pm->*getter)(&s), S_OK);
         return ToUtf8(s);
     }
-    std::string Public() {
-        BSTR s = nullptr;
-        EXPECT_EQ(H().pm->get_PublicIpAddress(&s), S_OK);
-        return ToUtf8(s);
-    }
-    std::string SipServer() {
-        BSTR s = nullptr;
-        EXPECT_EQ(H().pm->get_RecommendedSipServer(&s), S_OK);
-        return ToUtf8(s);
-    }
-    std::string Suffix() {
-        BSTR s = nullptr;
-        EXPECT_EQ(H().pm->get_ClientNameSuffix(&s), S_OK);
-        return ToUtf8(s);
-    }
+    std::string Private() { return Text(&IAdvancedPortManager::get_PrivateIpAddress); }
+    std::string Public() { return Text(&IAdvancedPortManager::get_PublicIpAddress); }
+    std::string SipServer() { return Text(&IAdvancedPortManager::get_RecommendedSipServer); }
+    std::string Suffix() { return Text(&IAdvancedPortManager::get_ClientNameSuffix); }
     PM_STATE State() {
         PM_STATE s{};
         EXPECT_EQ(H().pm->get_State(&s), S_OK);
@@ -246,129 +237,146 @@ TEST_F(PortManager, UdpPacketsInPassesTheHostCounterOrItsError) {
     EXPECT_EQ(H().pm->get_UDPPacketsIn(nullptr), E_POINTER);
 }
 
-// The outcome of one STUN pass with the given entries.
-struct Outcome {
+// One STUN pass with the given entries, on a fresh port manager, and what the client then reads.
+struct OutcomeCase {
+    const char* what;
+    std::vector<stun::STUNResultEntry> entries;
     PM_TOPOLOGY topology;
-    std::string privateAddress;
-    std::string publicAddress;
-    std::string sipServer;
-    std::string suffix;
+    const char* privateAddress;
+    const char* publicAddress;
+    bool viaSipProxy;
+    bool stunSuffix;
     bool portManagerRecommended;
+    bool noLocalAddress = false;
 };
 
 class StunOutcome : public PortManager {
   protected:
-    Outcome Run(std::initializer_list<stun::STUNResultEntry> entries, int32_t count = -1) {
-        H().nextList.count = count >= 0 ? count : static_cast<int32_t>(entries.size());
-        int i = 0;
-        for (const auto& e : entries) {
-            H().nextList.entries[i++] = e;
+    void Check(const OutcomeCase& c) {
+        SCOPED_TRACE(c.what);
+        Renew();
+        net.adapters.clear();
+        if (!c.noLocalAddress) {
+            net.AddInterface("192.0.2.10", "192.0.2.1");
         }
+        H().nextList.count = static_cast<int32_t>(c.entries.size());
+        std::copy(c.entries.begin(), c.entries.end(), H().nextList.entries);
         RecordingSink& sink = NewSink();
         H().Connect(sink);
-        EXPECT_EQ(H().Initialize(false, true), S_OK);
+        ASSERT_EQ(H().Initialize(false, true), S_OK);
         EXPECT_EQ(State(), PMS_INITIALIZING);
         PumpUntilEvents(sink, 1);
         EXPECT_EQ(sink.received.size(), 1u);
         EXPECT_EQ(State(), PMS_COMPLETED);
-        return {Topology(), Private(), Public(), SipServer(), Suffix(), PortManagerRecommended()};
+        EXPECT_EQ(Topology(), c.topology);
+        EXPECT_EQ(Private(), c.privateAddress);
+        EXPECT_EQ(Public(), c.publicAddress);
+        EXPECT_EQ(SipServer(), c.viaSipProxy ? "sip.example.net" : "media.example.net");
+        EXPECT_EQ(Suffix(), c.stunSuffix ? "STUN" : "");
+        EXPECT_EQ(PortManagerRecommended(), c.portManagerRecommended);
     }
 };
 
-TEST_F(StunOutcome, LeastRestrictiveClassifiedEntryIsChosen) {
-    const Outcome o = Run({{A, stun::STUN_RESULT_SYMMETRIC_NAT, stun::kNoPublicAddress},
-                           {B, stun::STUN_RESULT_FULL_CONE_NAT, Q}});
-    EXPECT_EQ(o.topology, PMT_STUN_FULL_CONE_NAT);
-    EXPECT_EQ(o.privateAddress, "192.0.2.11");
-    EXPECT_EQ(o.publicAddress, "203.0.113.9");
-    EXPECT_EQ(o.sipServer, "sip.example.net");
-    EXPECT_EQ(o.suffix, "STUN");
-    EXPECT_TRUE(o.portManagerRecommended);
-}
-
-TEST_F(StunOutcome, UnclassifiedFirstEntryStaysChosen) {
-    const Outcome o = Run({{A, stun::STUN_RESULT_UNKNOWN, 0}, {B, stun::STUN_RESULT_OPEN, Q}});
-    EXPECT_EQ(o.topology, PMT_UNKNOWN);
-    EXPECT_EQ(o.sipServer, "media.example.net");
-    EXPECT_EQ(o.privateAddress, "192.0.2.10");  // from the monitor
-    EXPECT_EQ(o.publicAddress, "192.0.2.10");
-    EXPECT_EQ(o.suffix, "");
-}
-
-TEST_F(StunOutcome, EqualResultsKeepTheFirst) {
-    const Outcome o = Run({{A, stun::STUN_RESULT_RESTRICTED_CONE_NAT, P},
-                           {B, stun::STUN_RESULT_RESTRICTED_CONE_NAT, Q}});
-    EXPECT_EQ(o.topology, PMT_STUN_RESTRICTED_CONE_NAT);
-    EXPECT_EQ(o.privateAddress, "192.0.2.10");
-    EXPECT_EQ(o.publicAddress, "198.51.100.7");
-}
-
-TEST_F(StunOutcome, EveryConeResultRecommendsTheSipProxyWithStunAddresses) {
-    for (uint8_t r = stun::STUN_RESULT_OPEN; r <= stun::STUN_RESULT_PORT_RESTRICTED_CONE_NAT; ++r) {
-        Renew();
-        const Outcome o = Run({{B, r, P}});
-        EXPECT_EQ(o.topology, static_cast<PM_TOPOLOGY>(r));
-        EXPECT_EQ(o.privateAddress, "192.0.2.11");
-        EXPECT_EQ(o.publicAddress, "198.51.100.7");
-        EXPECT_EQ(o.sipServer, "sip.example.net");
-        EXPECT_EQ(o.suffix, "STUN");
-        EXPECT_TRUE(o.portManagerRecommended);
+TEST_F(StunOutcome, EveryResultGivesItsTopologyAddressesAndRecommendations) {
+    using namespace stun;
+    const uint32_t none = kNoPublicAddress;
+    const OutcomeCase cases[] = {
+        {"least restrictive chosen",
+         {{A, STUN_RESULT_SYMMETRIC_NAT, none}, {B, STUN_RESULT_FULL_CONE_NAT, Q}},
+         PMT_STUN_FULL_CONE_NAT,
+         "192.0.2.11",
+         "203.0.113.9",
+         true,
+         true,
+         true},
+        {"unclassified first entry stays chosen",
+         {{A, STUN_RESULT_UNKNOWN, 0}, {B, STUN_RESULT_OPEN, Q}},
+         PMT_UNKNOWN,
+         "192.0.2.10",
+         "192.0.2.10",
+         false,
+         false,
+         true},
+        {"equal results keep the first",
+         {{A, STUN_RESULT_RESTRICTED_CONE_NAT, P}, {B, STUN_RESULT_RESTRICTED_CONE_NAT, Q}},
+         PMT_STUN_RESTRICTED_CONE_NAT,
+         "192.0.2.10",
+         "198.51.100.7",
+         true,
+         true,
+         true},
+        {"open",
+         {{B, STUN_RESULT_OPEN, P}},
+         PMT_STUN_OPEN,
+         "192.0.2.11",
+         "198.51.100.7",
+         true,
+         true,
+         true},
+        {"full cone firewall",
+         {{B, STUN_RESULT_FULL_CONE_FIREWALL, P}},
+         PMT_STUN_FULL_CONE_FIREWALL,
+         "192.0.2.11",
+         "198.51.100.7",
+         true,
+         true,
+         true},
+        {"port restricted",
+         {{B, STUN_RESULT_PORT_RESTRICTED_CONE_NAT, P}},
+         PMT_STUN_PORT_RESTRICTED_CONE_NAT,
+         "192.0.2.11",
+         "198.51.100.7",
+         true,
+         true,
+         true},
+        {"symmetric firewall",
+         {{B, STUN_RESULT_SYMMETRIC_FIREWALL, P}},
+         PMT_STUN_SYMMETRIC_FIREWALL,
+         "192.0.2.11",
+         "192.0.2.11",
+         false,
+         false,
+         true},
+        {"symmetric NAT",
+         {{B, STUN_RESULT_SYMMETRIC_NAT, P}},
+         PMT_STUN_SYMMETRIC_NAT,
+         "192.0.2.11",
+         "192.0.2.11",
+         false,
+         false,
+         true},
+        {"blocked falls back to the monitor's address",
+         {{B, STUN_RESULT_BLOCKED, none}},
+         PMT_STUN_BLOCKED,
+         "192.0.2.10",
+         "192.0.2.10",
+         false,
+         false,
+         true},
+        {"blocked without any local address",
+         {{B, STUN_RESULT_BLOCKED, none}},
+         PMT_STUN_BLOCKED,
+         "",
+         "",
+         false,
+         false,
+         false,
+         true},
+        {"empty list", {}, PMT_UNKNOWN, "192.0.2.10", "192.0.2.10", false, false, true},
+    };
+    for (const auto& c : cases) {
+        Check(c);
     }
-}
-
-TEST_F(StunOutcome, SymmetricResultsRecommendTheMediaProxyWithTheLocalAddress) {
-    for (uint8_t r : {stun::STUN_RESULT_SYMMETRIC_FIREWALL, stun::STUN_RESULT_SYMMETRIC_NAT}) {
-        Renew();
-        const Outcome o = Run({{B, r, P}});
-        EXPECT_EQ(o.topology, static_cast<PM_TOPOLOGY>(r));
-        EXPECT_EQ(o.privateAddress, "192.0.2.11");
-        EXPECT_EQ(o.publicAddress, "192.0.2.11");
-        EXPECT_EQ(o.sipServer, "media.example.net");
-        EXPECT_EQ(o.suffix, "");
-        EXPECT_TRUE(o.portManagerRecommended);
-    }
-}
-
-TEST_F(StunOutcome, BlockedFallsBackButKeepsItsTopology) {
-    const Outcome o = Run({{B, stun::STUN_RESULT_BLOCKED, stun::kNoPublicAddress}});
-    EXPECT_EQ(o.topology, PMT_STUN_BLOCKED);
-    EXPECT_EQ(o.privateAddress, "192.0.2.10");
-    EXPECT_EQ(o.publicAddress, "192.0.2.10");
-    EXPECT_EQ(o.sipServer, "media.example.net");
-    EXPECT_TRUE(o.portManagerRecommended);
-}
-
-TEST_F(StunOutcome, BlockedWithNoLocalAddressRecommendsNoPortManager) {
-    net.adapters.clear();
-    const Outcome o = Run({{B, stun::STUN_RESULT_BLOCKED, stun::kNoPublicAddress}});
-    EXPECT_EQ(o.privateAddress, "");
-    EXPECT_FALSE(o.portManagerRecommended);
 }
 
 TEST_F(StunOutcome, ValueOutsideTheResultsIsLoggedAndFallsBack) {
-    std::vector<std::string> lines;
-    platform::SetDebugOutputSink([&](std::string_view l) { lines.emplace_back(l); });
-    foundation::Logger().Initialize(std::nullopt, std::nullopt, std::nullopt, 0, true);
-    const Outcome o = Run({{B, 9, P}});
-    foundation::Logger().Initialize(std::nullopt, std::nullopt, std::nullopt, 0, false);
-    platform::SetDebugOutputSink(nullptr);
-    EXPECT_EQ(o.topology, PMT_UNKNOWN);
-    EXPECT_EQ(o.privateAddress, "192.0.2.11");
-    EXPECT_EQ(o.publicAddress, "192.0.2.11");
-    EXPECT_EQ(o.sipServer, "media.example.net");
+    testsupport::LogCapture log;
+    Check({"value 9", {{B, 9, P}}, PMT_UNKNOWN, "192.0.2.11", "192.0.2.11", false, false, true});
     bool logged = false;
-    for (const auto& l : lines) {
-        logged |= l.find("ERROR, CAdvancedPortManager::OnStunRefresh pResult->stunResult = 0x9") !=
-                  std::string::npos;
+    for (const auto& line : log.LinesOf("CAdvancedPortManager::OnStunRefresh")) {
+        logged |= line.level == "ERROR" && line.message == "pResult->stunResult = 0x9";
     }
     EXPECT_TRUE(logged);
-}
-
-TEST_F(StunOutcome, EmptyListCompletesWithTheFallBack) {
-    const Outcome o = Run({}, 0);
-    EXPECT_EQ(o.topology, PMT_UNKNOWN);
-    EXPECT_EQ(o.sipServer, "media.example.net");
-    EXPECT_EQ(o.privateAddress, "192.0.2.10");
 }
 
 TEST_F(PortManager, RefreshClearsTheRecommendationButKeepsTheAddresses) {
@@ -527,12 +535,6 @@ TEST_F(PortManager, ReleasingTheObjectReleasesConnectedSinks) {
 
 TEST_F(PortManager, EventObjectKeepsThePortManagerAndAcceptsANullPut) {
     IPortManagerUpdateEvent* kept = nullptr;
-    RecordingSink& sink = NewSink();
-    sink.onEvent = [&](PM_EVENT) {
-        // The sink keeps no reference; the test takes one through the event's property.
-    };
-    H().Connect(sink);
-    ASSERT_EQ(H().Initialize(false, false), S_OK);
     ASSERT_EQ(portmanager::PortManagerUpdateEvent::Create(&kept), S_OK);
     ASSERT_EQ(kept->put_PortManager(H().pm), S_OK);
     IAdvancedPortManager* pm = nullptr;

@@ -1,19 +1,13 @@
-// Helpers of the port mapping tests: log capture, loopback sockets that close themselves, and a
-// window of free loopback ports.
+// Helpers of the port mapping tests: loopback sockets that close themselves, pools that close
+// their placeholders, and windows of free loopback ports.
 #pragma once
-
-#include <gtest/gtest.h>
 
 #include <cstdint>
 #include <deque>
-#include <mutex>
 #include <optional>
 #include <random>
-#include <string>
-#include <string_view>
 #include <vector>
 
-#include "foundation/Logger.h"
 #include "platform/kernel.h"
 #include "platform/net.h"
 #include "portmanager/PortMappingPool.h"
@@ -25,10 +19,8 @@ inline constexpr const char* kLoopback = "127.0.0.1";
 inline constexpr uint32_t kLoopbackHost = 0x7F000001;
 
 using testsupport::LogCapture;
-using testsupport::LogLine;
 
-// A loopback UDP socket that closes itself: a listener on an arbitrary port, or the client's
-// own socket on a chosen one (with or without SO_REUSEADDR set before the bind).
+// A loopback UDP socket on `port` (0: any), optionally with SO_REUSEADDR set before the bind.
 class LoopbackSocket {
   public:
     explicit LoopbackSocket(uint16_t port = 0, bool reuse = false)
@@ -56,8 +48,7 @@ class LoopbackSocket {
         uint32_t fromAddress = 0;
         uint16_t fromPort = 0;
     };
-    // The next datagram; empty when none arrives in time. Only a safety net against a hang:
-    // the tests send a datagram they expect before they look, so they never wait for silence.
+    // The timeout only guards against a hang: tests look only for datagrams they expect.
     std::optional<Datagram> Receive(int timeoutMs = 2000) {
         if (platform::WaitSocketReadable(m_handle, timeoutMs) != 1) {
             return std::nullopt;
@@ -78,12 +69,16 @@ class LoopbackSocket {
     uint16_t m_port = 0;
 };
 
-// A pool that closes its free list when the test ends, however it ends.
+// Whether something holds the port, so that a socket without SO_REUSEADDR cannot bind it.
+inline bool IsHeld(int32_t port) {
+    return !LoopbackSocket(static_cast<uint16_t>(port)).IsBound();
+}
+
 struct ScopedPool : PortMappingPool {
     ~ScopedPool() { CloseFree(); }
 };
 
-// The private ports of the free list, front to back, relative to a base port.
+// The private ports of the free list, front to back, relative to `base`.
 inline std::vector<int32_t> FreeOffsets(const PortMappingPool& pool, int32_t base) {
     std::vector<int32_t> offsets;
     for (const MappedServiceEndpoint& mapping : pool.Free()) {
@@ -92,9 +87,8 @@ inline std::vector<int32_t> FreeOffsets(const PortMappingPool& pool, int32_t bas
     return offsets;
 }
 
-// An even base port whose window [base, base + size) is free on loopback right now, below the
-// ephemeral range so that no socket bound to port 0 lands in it. Bases are drawn at random so
-// that test processes running side by side rarely probe the same window.
+// An even base whose [base, base + size) is free now, below the ephemeral range so that no
+// port-0 bind lands in it; random so that parallel test processes rarely collide.
 inline std::optional<int32_t> FindFreeWindow(int32_t size) {
     std::mt19937 generator{std::random_device{}()};
     std::uniform_int_distribution<int32_t> slot(0, 5000);

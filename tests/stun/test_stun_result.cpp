@@ -35,36 +35,23 @@ constexpr platform::WPARAM kWParam = 42;
 constexpr uint32_t kLocal = 0x7F000005;  // 127.0.0.5
 constexpr int kPassTimeoutMs = 20000;
 
-int64_t MsSince(Clock::time_point start) {
-    return std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - start).count();
-}
-
-// Each address is the only one of an interface with a (made-up) default gateway. Set up before
-// the service starts and only read afterwards.
-class LocalAddresses {
-  public:
+// Each address is the only one of an interface with a (made-up) default gateway.
+struct LocalAddresses : testsupport::FakeNetworkInfo {
     explicit LocalAddresses(const std::vector<uint32_t>& addresses) {
         for (uint32_t a : addresses) {
-            info_.AddInterface(foundation::FormatHostAddress(a), "127.0.0.254");
+            AddInterface(foundation::FormatHostAddress(a), "127.0.0.254");
         }
     }
-
-  private:
-    testsupport::FakeNetworkInfo info_;
 };
 
 // The owner's window: records what the service posts; the test thread pumps it.
-class Window : public platform::MessageWindow {
-  public:
+struct Window : platform::MessageWindow {
     struct Posted {
         platform::UINT message;
         platform::WPARAM wParam;
         platform::LPARAM lParam;
     };
-
     Window() { CreateMessageWindow(); }
-    ~Window() override { DestroyMessageWindow(); }
-
     platform::LRESULT WindowProc(platform::UINT message, platform::WPARAM wParam,
                                  platform::LPARAM lParam, bool& handled) override {
         posted.push_back({message, wParam, lParam});
@@ -72,39 +59,49 @@ class Window : public platform::MessageWindow {
         return 0;
     }
     // Pumps until count messages arrived; false after timeoutMs.
-    bool WaitFor(size_t count, int timeoutMs) {
+    bool WaitFor(size_t count, int timeoutMs = kPassTimeoutMs) {
         return platform::RunMessageLoopUntil([&] { return posted.size() >= count; }, timeoutMs);
     }
-
     std::vector<Posted> posted;
 };
 
-// The classification always asks port 3478, so the fake takes it on a loopback address of this
-// process's own (derived from the pid, as the stund fixture does, but ending in .9).
-std::unique_ptr<FakeStunServer> StartFakeOn3478() {
-    const unsigned pid = static_cast<unsigned>(platform::testing::CurrentProcessId());
-    for (unsigned candidate = 0; candidate < 8; ++candidate) {
-        const unsigned key = pid + candidate;
-        const uint32_t address =
-            (127u << 24) | ((1 + (key / 256) % 254) << 16) | ((key % 256) << 8) | 9u;
-        auto server = std::make_unique<FakeStunServer>(address, stun::kSTUNPort);
-        if (server->IsRunning()) {
-            return server;
+// The service under a silent fake. The classification always asks port 3478, so the fake takes
+// it on a loopback address of this process's own (derived from the pid, as the stund fixture
+// does, but ending in .9).
+class STUNResultInATransaction : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        const unsigned pid = static_cast<unsigned>(platform::testing::CurrentProcessId());
+        for (unsigned key = pid; key < pid + 8 && !fake_; ++key) {
+            const uint32_t address =
+                (127u << 24) | ((1 + (key / 256) % 254) << 16) | ((key % 256) << 8) | 9u;
+            fake_ = std::make_unique<FakeStunServer>(address, stun::kSTUNPort);
+            if (!fake_->IsRunning()) {
+                fake_.reset();
+            }
         }
+        ASSERT_NE(fake_, nullptr);
+        fake_->SetMode(FakeStunServer::Mode::kSilent);
+        server_ = foundation::FormatHostAddress(fake_->Address());
     }
-    return nullptr;
-}
 
-std::string Text(uint32_t address) {
-    return foundation::FormatHostAddress(address);
-}
+    LocalAddresses local_{{kLocal}};
+    std::unique_ptr<FakeStunServer> fake_;
+    std::string server_;
+    Window window_;
+};
 
 class STUNResultWithStund : public testsupport::StundTest {};
 
-TEST_F(STUNResultWithStund, ReadyOnlyOnceARefreshHasCompletedAPassAlsoAfterARestart) {
-    LocalAddresses local({kLocal});
+TEST_F(STUNResultWithStund, ReadyOnceARefreshCompletedAPassOfTheFirstTenAddressesAlsoAfterStop) {
+    std::vector<uint32_t> addresses;
+    for (uint32_t i = 0; i < 12; ++i) {
+        addresses.push_back(kLocal + i);
+    }
+    LocalAddresses local(addresses);
     Window window;
-    CSTUNResult service(Text(stund_.PrimaryAddress()).c_str(), window.Handle(), kMessage, kWParam);
+    CSTUNResult service(foundation::FormatHostAddress(stund_.PrimaryAddress()).c_str(),
+                        window.Handle(), kMessage, kWParam);
     EXPECT_FALSE(service.IsRunning());
     ASSERT_EQ(service.Start(), S_OK);
     EXPECT_TRUE(service.IsRunning());
@@ -112,124 +109,89 @@ TEST_F(STUNResultWithStund, ReadyOnlyOnceARefreshHasCompletedAPassAlsoAfterARest
     EXPECT_FALSE(service.IsSTUNResultReady());
 
     ASSERT_EQ(service.Refresh(), S_OK);
-    ASSERT_TRUE(window.WaitFor(1, kPassTimeoutMs));
+    ASSERT_TRUE(window.WaitFor(1));
     EXPECT_EQ(window.posted[0].message, kMessage);
     EXPECT_EQ(window.posted[0].wParam, kWParam);
     EXPECT_EQ(window.posted[0].lParam, 0);
     EXPECT_TRUE(service.IsSTUNResultReady());
     STUNResultList list;
     ASSERT_TRUE(service.GetSTUNResult(&list));
-    ASSERT_EQ(list.count, 1);
-    // Loopback has no NAT in between: the host is open and seen with its own address.
-    EXPECT_EQ(list.entries[0].localAddress, kLocal);
-    EXPECT_EQ(list.entries[0].stunResult, stun::STUN_RESULT_OPEN);
-    EXPECT_EQ(list.entries[0].publicAddress, kLocal);
+    ASSERT_EQ(list.count, 10);
+    // Loopback has no NAT in between: each host is open and seen with its own address.
+    for (int i = 0; i < 10; ++i) {
+        EXPECT_EQ(list.entries[i].localAddress, addresses[i]) << i;
+        EXPECT_EQ(list.entries[i].stunResult, stun::STUN_RESULT_OPEN) << i;
+        EXPECT_EQ(list.entries[i].publicAddress, addresses[i]) << i;
+    }
 
     service.Stop();
     EXPECT_FALSE(service.IsRunning());
     EXPECT_TRUE(service.IsSTUNResultReady()) << "Stop keeps the last results";
     ASSERT_EQ(service.Refresh(), S_OK);
     EXPECT_TRUE(service.IsRunning());
-    ASSERT_TRUE(window.WaitFor(2, kPassTimeoutMs)) << "no pass after the restart";
+    ASSERT_TRUE(window.WaitFor(2)) << "no pass after the restart";
     EXPECT_TRUE(service.IsSTUNResultReady());
-}
-
-TEST_F(STUNResultWithStund, APassClassifiesOnlyTheFirstTenAddressesInTheirOrder) {
-    std::vector<uint32_t> addresses;
-    for (uint32_t i = 0; i < 12; ++i) {
-        addresses.push_back(kLocal + i);
-    }
-    LocalAddresses local(addresses);
-    Window window;
-    CSTUNResult service(Text(stund_.PrimaryAddress()).c_str(), window.Handle(), kMessage, kWParam);
-    ASSERT_EQ(service.Refresh(), S_OK);
-    ASSERT_TRUE(window.WaitFor(1, kPassTimeoutMs));
-    STUNResultList list;
-    ASSERT_TRUE(service.GetSTUNResult(&list));
-    ASSERT_EQ(list.count, 10);
-    for (int i = 0; i < 10; ++i) {
-        EXPECT_EQ(list.entries[i].localAddress, addresses[i]) << i;
-        EXPECT_EQ(list.entries[i].stunResult, stun::STUN_RESULT_OPEN) << i;
-        EXPECT_EQ(list.entries[i].publicAddress, addresses[i]) << i;
-    }
 }
 
 TEST(STUNResult, APassWithoutAServerOrWithoutAddressesStillStoresAndPosts) {
     // "0.0.0.0" resolves to 0 and a missing list to nothing: both count as unresolved.
-    for (const char* servers : {"0.0.0.0", static_cast<const char*>(nullptr)}) {
-        LocalAddresses local({kLocal, kLocal + 1});
+    const struct {
+        const char* servers;
+        std::vector<uint32_t> addresses;
+    } cases[] = {
+        {"0.0.0.0", {kLocal, kLocal + 1}}, {nullptr, {kLocal, kLocal + 1}}, {"127.0.0.1", {}}};
+    for (const auto& c : cases) {
+        LocalAddresses local(c.addresses);
         Window window;
-        CSTUNResult service(servers, window.Handle(), kMessage, kWParam);
+        CSTUNResult service(c.servers, window.Handle(), kMessage, kWParam);
         ASSERT_EQ(service.Refresh(), S_OK);
-        ASSERT_TRUE(window.WaitFor(1, kPassTimeoutMs));
+        ASSERT_TRUE(window.WaitFor(1));
         STUNResultList list;
+        list.count = 5;
         ASSERT_TRUE(service.GetSTUNResult(&list));
-        ASSERT_EQ(list.count, 2);
-        for (int i = 0; i < 2; ++i) {
-            EXPECT_EQ(list.entries[i].localAddress, kLocal + static_cast<uint32_t>(i));
+        ASSERT_EQ(list.count, static_cast<int>(c.addresses.size()));
+        for (int i = 0; i < list.count; ++i) {
+            EXPECT_EQ(list.entries[i].localAddress, c.addresses[i]);
             EXPECT_EQ(list.entries[i].stunResult, stun::STUN_RESULT_UNKNOWN);
             EXPECT_EQ(list.entries[i].publicAddress, stun::kNoPublicAddress);
         }
     }
-    LocalAddresses none({});
-    Window window;
-    CSTUNResult service("127.0.0.1", window.Handle(), kMessage, kWParam);
-    ASSERT_EQ(service.Refresh(), S_OK);
-    ASSERT_TRUE(window.WaitFor(1, kPassTimeoutMs));
-    STUNResultList list;
-    list.count = 5;
-    ASSERT_TRUE(service.GetSTUNResult(&list));
-    EXPECT_EQ(list.count, 0);
 }
 
-TEST(STUNResult, RefreshesDuringAPassGiveExactlyOneFurtherPass) {
-    LocalAddresses local({kLocal});
-    auto fake = StartFakeOn3478();
-    ASSERT_NE(fake, nullptr);
-    fake->SetMode(FakeStunServer::Mode::kSilent);
-    Window window;
-    CSTUNResult service(Text(fake->Address()).c_str(), window.Handle(), kMessage, kWParam);
+TEST_F(STUNResultInATransaction, RefreshesDuringAPassGiveExactlyOneFurtherPass) {
+    CSTUNResult service(server_.c_str(), window_.Handle(), kMessage, kWParam);
     ASSERT_EQ(service.Refresh(), S_OK);
-    ASSERT_TRUE(fake->WaitForRequests(1, 5000));  // the pass now waits for an answer
+    ASSERT_TRUE(fake_->WaitForRequests(1, 5000));  // the pass now waits for an answer
     ASSERT_EQ(service.Refresh(), S_OK);
     ASSERT_EQ(service.Refresh(), S_OK);
     EXPECT_FALSE(service.IsSTUNResultReady());
-    fake->SetMode(FakeStunServer::Mode::kAnswer);
+    fake_->SetMode(FakeStunServer::Mode::kAnswer);
 
-    ASSERT_TRUE(window.WaitFor(2, kPassTimeoutMs));
+    ASSERT_TRUE(window_.WaitFor(2));
     // An answered pass takes milliseconds here: a third one would have posted by now.
-    EXPECT_FALSE(window.WaitFor(3, 1000));
+    EXPECT_FALSE(window_.WaitFor(3, 1000));
     EXPECT_TRUE(service.IsSTUNResultReady());
 }
 
-TEST(STUNResult, StopInsideATransactionEndsThePassAtOnceWithoutResultOrLeak) {
-    LocalAddresses local({kLocal});
-    auto fake = StartFakeOn3478();
-    ASSERT_NE(fake, nullptr);
-    fake->SetMode(FakeStunServer::Mode::kSilent);
-    Window window;
+TEST_F(STUNResultInATransaction, StopEndsThePassAtOnceWithoutResultOrLeak) {
     const int descriptors = platform::CountOpenDescriptors();
     {
-        CSTUNResult service(Text(fake->Address()).c_str(), window.Handle(), kMessage, kWParam);
+        CSTUNResult service(server_.c_str(), window_.Handle(), kMessage, kWParam);
         ASSERT_EQ(service.Refresh(), S_OK);
-        ASSERT_TRUE(fake->WaitForRequests(2, 5000));  // inside the retransmission schedule
+        ASSERT_TRUE(fake_->WaitForRequests(2, 5000));  // inside the retransmission schedule
         const auto stopping = Clock::now();
         service.Stop();
-        EXPECT_LT(MsSince(stopping), 300);
+        EXPECT_LT(Clock::now() - stopping, std::chrono::milliseconds(300));
         EXPECT_FALSE(service.IsRunning());
         EXPECT_EQ(platform::CountOpenDescriptors(), descriptors);
-        EXPECT_FALSE(window.WaitFor(1, 300)) << "the stopped pass posted";
+        EXPECT_FALSE(window_.WaitFor(1, 300)) << "the stopped pass posted";
         EXPECT_FALSE(service.IsSTUNResultReady()) << "the stopped pass stored its results";
     }
     EXPECT_EQ(platform::CountOpenDescriptors(), descriptors);
 }
 
-TEST(STUNResult, GetSTUNResultWaitsOnlyForAPassThatWasAskedFor) {
-    LocalAddresses local({kLocal});
-    auto fake = StartFakeOn3478();
-    ASSERT_NE(fake, nullptr);
-    fake->SetMode(FakeStunServer::Mode::kSilent);
-    CSTUNResult service(Text(fake->Address()).c_str(), nullptr, kMessage, kWParam);
+TEST_F(STUNResultInATransaction, GetSTUNResultWaitsOnlyForAPassThatWasAskedFor) {
+    CSTUNResult service(server_.c_str(), nullptr, kMessage, kWParam);
     STUNResultList untouched;
     untouched.count = 77;
     EXPECT_FALSE(service.GetSTUNResult(nullptr));
@@ -237,8 +199,8 @@ TEST(STUNResult, GetSTUNResultWaitsOnlyForAPassThatWasAskedFor) {
     EXPECT_TRUE(service.IsRunning());
 
     ASSERT_EQ(service.Refresh(), S_OK);
-    ASSERT_TRUE(fake->WaitForRequests(1, 5000));  // the pass now waits for an answer
-    std::atomic<int> outcome{-1};                 // 1 copied, 0 gave up without copying
+    ASSERT_TRUE(fake_->WaitForRequests(1, 5000));  // the pass now waits for an answer
+    std::atomic<int> outcome{-1};                  // 1 copied, 0 gave up without copying
     std::thread reader([&] {
         STUNResultList list = untouched;
         const bool copied = service.GetSTUNResult(&list);
@@ -250,7 +212,7 @@ TEST(STUNResult, GetSTUNResultWaitsOnlyForAPassThatWasAskedFor) {
     service.Stop();
     reader.join();
     EXPECT_EQ(outcome.load(), 0);
-    EXPECT_LT(MsSince(stopping), CSTUNResult::kPollMs + 500);
+    EXPECT_LT(Clock::now() - stopping, std::chrono::milliseconds(CSTUNResult::kPollMs + 500));
     EXPECT_EQ(untouched.count, 77);
 }
 

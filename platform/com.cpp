@@ -715,22 +715,14 @@ HRESULT SafeArrayPutElement(SAFEARRAY* psa, LONG* rgIndices, void* pv) {
             SysFreeString(std::exchange(*reinterpret_cast<BSTR*>(address), copy));
             return S_OK;
         }
-        case VT_UNKNOWN: {
+        case VT_UNKNOWN:
+        case VT_DISPATCH: {
+            // IDispatch starts with its IUnknown, so both element kinds hold the same pointer.
             auto* p = static_cast<IUnknown*>(pv);
             if (p != nullptr) {
                 p->AddRef();
             }
             if (IUnknown* old = std::exchange(*reinterpret_cast<IUnknown**>(address), p)) {
-                old->Release();
-            }
-            return S_OK;
-        }
-        case VT_DISPATCH: {
-            auto* p = static_cast<IDispatch*>(pv);
-            if (p != nullptr) {
-                p->AddRef();
-            }
-            if (IDispatch* old = std::exchange(*reinterpret_cast<IDispatch**>(address), p)) {
                 old->Release();
             }
             return S_OK;

@@ -31,7 +31,6 @@ const Expectation kBehaviours[] = {
     {"blocked", "STUN_RESULT_BLOCKED", false, false},
 };
 
-// The value of "key": in a flat JSON text (strings unquoted; null stays null).
 using testsupport::JsonField;
 
 class LabClassify : public ::testing::TestWithParam<int> {};

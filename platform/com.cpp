@@ -519,15 +519,9 @@ void ClearElements(SAFEARRAY* psa) {
             }
             break;
         case VT_UNKNOWN:
+        case VT_DISPATCH:  // an IDispatch pointer is its IUnknown pointer
             for (ULONG i = 0; i < count; ++i) {
                 if (IUnknown* p = std::exchange(Elements<IUnknown*>(psa)[i], nullptr)) {
-                    p->Release();
-                }
-            }
-            break;
-        case VT_DISPATCH:
-            for (ULONG i = 0; i < count; ++i) {
-                if (IDispatch* p = std::exchange(Elements<IDispatch*>(psa)[i], nullptr)) {
                     p->Release();
                 }
             }
@@ -664,20 +658,13 @@ HRESULT SafeArrayGetElement(SAFEARRAY* psa, LONG* rgIndices, void* pv) {
             *static_cast<BSTR*>(pv) = copy;
             return S_OK;
         }
-        case VT_UNKNOWN: {
+        case VT_UNKNOWN:
+        case VT_DISPATCH: {  // an IDispatch pointer is its IUnknown pointer
             IUnknown* p = *reinterpret_cast<IUnknown**>(address);
             if (p != nullptr) {
                 p->AddRef();
             }
             *static_cast<IUnknown**>(pv) = p;
-            return S_OK;
-        }
-        case VT_DISPATCH: {
-            IDispatch* p = *reinterpret_cast<IDispatch**>(address);
-            if (p != nullptr) {
-                p->AddRef();
-            }
-            *static_cast<IDispatch**>(pv) = p;
             return S_OK;
         }
         case VT_VARIANT: {
@@ -716,8 +703,7 @@ HRESULT SafeArrayPutElement(SAFEARRAY* psa, LONG* rgIndices, void* pv) {
             return S_OK;
         }
         case VT_UNKNOWN:
-        case VT_DISPATCH: {
-            // IDispatch starts with its IUnknown, so both element kinds hold the same pointer.
+        case VT_DISPATCH: {  // an IDispatch pointer is its IUnknown pointer
             auto* p = static_cast<IUnknown*>(pv);
             if (p != nullptr) {
                 p->AddRef();
@@ -834,18 +820,11 @@ HRESULT SafeArrayCopy(SAFEARRAY* psa, SAFEARRAY** ppsaOut) {
             }
             break;
         case VT_UNKNOWN:
+        case VT_DISPATCH:  // an IDispatch pointer is its IUnknown pointer
             for (ULONG i = 0; i < count; ++i) {
                 if (IUnknown* p = Elements<IUnknown*>(psa)[i]) {
                     p->AddRef();
                     Elements<IUnknown*>(copy)[i] = p;
-                }
-            }
-            break;
-        case VT_DISPATCH:
-            for (ULONG i = 0; i < count; ++i) {
-                if (IDispatch* p = Elements<IDispatch*>(psa)[i]) {
-                    p->AddRef();
-                    Elements<IDispatch*>(copy)[i] = p;
                 }
             }
             break;

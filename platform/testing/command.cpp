@@ -7,6 +7,8 @@
 
 #include <cerrno>
 
+#include "platform/testing/process.h"
+
 extern char** environ;
 
 namespace platform::testing {
@@ -29,8 +31,12 @@ int RunCommand(const std::vector<std::string>& argv, std::string* output) {
         args.push_back(const_cast<char*>(a.c_str()));
     }
     args.push_back(nullptr);
+    // Also finds the sbin tools (ip, stund) when PATH lacks them.
+    const std::string path = FindExecutable(argv[0]);
     pid_t pid = -1;
-    const int rc = posix_spawnp(&pid, args[0], &actions, nullptr, args.data(), environ);
+    const int rc = path.empty()
+                       ? ENOENT
+                       : posix_spawn(&pid, path.c_str(), &actions, nullptr, args.data(), environ);
     posix_spawn_file_actions_destroy(&actions);
     if (output != nullptr) {
         close(pipeFds[1]);

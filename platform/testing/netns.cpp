@@ -2,8 +2,6 @@
 
 #include <fcntl.h>
 #include <sched.h>
-#include <spawn.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -11,9 +9,7 @@
 #include <cstdlib>
 #include <sstream>
 
-#include "platform/testing/process.h"
-
-extern char** environ;
+#include "platform/testing/command.h"
 
 namespace platform::testing {
 
@@ -21,40 +17,13 @@ bool IsRoot() {
     return geteuid() == 0;
 }
 
-int RunProgram(const std::vector<std::string>& argv) {
-    if (argv.empty()) {
-        return -1;
-    }
-    const std::string path = FindExecutable(argv[0]);
-    if (path.empty()) {
-        return -1;
-    }
-    std::vector<char*> args;
-    for (const std::string& a : argv) {
-        args.push_back(const_cast<char*>(a.c_str()));
-    }
-    args.push_back(nullptr);
-    posix_spawn_file_actions_t actions;
-    if (posix_spawn_file_actions_init(&actions) != 0) {
-        return -1;
-    }
-    posix_spawn_file_actions_addopen(&actions, STDIN_FILENO, "/dev/null", O_RDONLY, 0);
-    posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, "/dev/null", O_WRONLY, 0);
-    posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, "/dev/null", O_WRONLY, 0);
-    pid_t pid = -1;
-    const int spawned = posix_spawn(&pid, path.c_str(), &actions, nullptr, args.data(), environ);
-    posix_spawn_file_actions_destroy(&actions);
-    if (spawned != 0) {
-        return -1;
-    }
-    int status = 0;
-    while (waitpid(pid, &status, 0) < 0) {
-        if (errno != EINTR) {
-            return -1;
-        }
-    }
-    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+namespace {
+// Runs a short command with its output dropped; its exit status.
+int Quietly(const std::vector<std::string>& argv) {
+    std::string ignored;
+    return RunCommand(argv, &ignored);
 }
+}  // namespace
 
 namespace {
 std::atomic<int> g_counter{0};
@@ -62,7 +31,7 @@ std::atomic<int> g_counter{0};
 
 ScopedNetns::ScopedNetns(const std::string& prefix)
     : name_(prefix + "-" + std::to_string(getpid()) + "-" + std::to_string(g_counter++)) {
-    if (RunProgram({"ip", "netns", "add", name_}) != 0) {
+    if (Quietly({"ip", "netns", "add", name_}) != 0) {
         return;
     }
     valid_ = true;
@@ -75,7 +44,7 @@ ScopedNetns::ScopedNetns(const std::string& prefix)
 ScopedNetns::~ScopedNetns() {
     Leave();
     // Also after a failed creation: a half-made namespace must not stay behind.
-    RunProgram({"ip", "netns", "delete", name_});
+    Quietly({"ip", "netns", "delete", name_});
 }
 
 bool ScopedNetns::Ip(const std::string& arguments) const {
@@ -85,7 +54,7 @@ bool ScopedNetns::Ip(const std::string& arguments) const {
     while (words >> word) {
         argv.push_back(word);
     }
-    return RunProgram(argv) == 0;
+    return Quietly(argv) == 0;
 }
 
 bool ScopedNetns::Enter() {

@@ -9,10 +9,6 @@ namespace platform::testing {
 
 bool IsRoot();
 
-// Runs a program (looked up in PATH and sbin) to completion with its output discarded. Returns
-// its exit status, or -1 when it could not be run or did not exit normally.
-int RunProgram(const std::vector<std::string>& argv);
-
 class ScopedNetns {
   public:
     // Creates a namespace named prefix-<pid>-<n> with its loopback interface up.

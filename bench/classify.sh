@@ -11,7 +11,7 @@
 set -euo pipefail
 
 root=$(cd "$(dirname "$0")/.." && pwd)
-lab=$root/tests/lab/natlab.sh
+lab=$root/tools/lab/natlab.sh
 nqpm=$root/build/bin/nqpm
 [ -x "$nqpm" ] || { echo "build first: $nqpm is missing" >&2; exit 1; }
 [ "$(id -u)" -eq 0 ] || { echo "needs root (network namespaces)" >&2; exit 1; }

@@ -20,7 +20,7 @@
 #include "platform/net.h"
 #include "platform/netchange.h"
 #include "platform/netinfo.h"
-#include "platform/testing/netns.h"
+#include "tests/support/os/netns.h"
 
 namespace {
 

@@ -6,7 +6,7 @@
 #include <string>
 
 #include "platform/message.h"
-#include "platform/testing/netns.h"
+#include "tests/support/os/netns.h"
 #include "tests/support/PortManagerDoubles.h"
 
 namespace {

@@ -7,7 +7,7 @@
 
 #include "platform/kernel.h"
 #include "platform/net.h"
-#include "platform/testing/enter_netns.h"
+#include "tests/support/os/enter_netns.h"
 #include "tests/support/NatLab.h"
 
 namespace {

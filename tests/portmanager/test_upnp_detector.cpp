@@ -16,9 +16,9 @@
 
 #include "platform/kernel.h"
 #include "platform/message.h"
-#include "platform/testing/command.h"
-#include "platform/testing/netns.h"
-#include "platform/testing/process.h"
+#include "tests/support/os/command.h"
+#include "tests/support/os/netns.h"
+#include "tests/support/os/process.h"
 #include "platform/upnp.h"
 #include "portmanager/UpnpDetector.h"
 

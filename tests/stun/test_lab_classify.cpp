@@ -6,7 +6,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/testing/command.h"
+#include "tests/support/os/command.h"
 
 #include "tests/support/JsonField.h"
 #include "tests/support/NatLab.h"

@@ -5,7 +5,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/testing/process.h"
+#include "tests/support/os/process.h"
 #include "stun/STUNClassify.h"
 #include "tests/support/DnsLab.h"
 #include "tests/support/FakeStunServer.h"

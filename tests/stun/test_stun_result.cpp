@@ -16,7 +16,7 @@
 #include "platform/kernel.h"
 #include "platform/message.h"
 #include "platform/net.h"
-#include "platform/testing/process.h"
+#include "tests/support/os/process.h"
 #include "stun/STUNClassify.h"
 #include "stun/STUNResult.h"
 #include "tests/support/FakeNetworkInfo.h"

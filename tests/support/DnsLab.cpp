@@ -5,8 +5,8 @@
 #include <fstream>
 
 #include "platform/kernel.h"
-#include "platform/testing/command.h"
-#include "platform/testing/netns.h"
+#include "tests/support/os/command.h"
+#include "tests/support/os/netns.h"
 
 namespace testsupport {
 

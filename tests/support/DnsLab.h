@@ -6,7 +6,7 @@
 
 #include <string>
 
-#include "platform/testing/process.h"
+#include "tests/support/os/process.h"
 
 namespace testsupport {
 

@@ -2,13 +2,13 @@
 
 #include <sstream>
 
-#include "platform/testing/command.h"
-#include "platform/testing/process.h"
+#include "tests/support/os/command.h"
+#include "tests/support/os/process.h"
 
 namespace testsupport {
 
 std::string NatLab::Script() {
-    return std::string(NQPM_SOURCE_DIR) + "/tests/lab/natlab.sh";
+    return std::string(NQPM_SOURCE_DIR) + "/tools/lab/natlab.sh";
 }
 
 bool NatLab::CanRun() {

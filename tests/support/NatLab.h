@@ -1,4 +1,4 @@
-// A NAT lab of network namespaces (tests/lab/natlab.sh) owned by one test: built in the
+// A NAT lab of network namespaces (tools/lab/natlab.sh) owned by one test: built in the
 // constructor's Up(), always removed by the destructor.
 #pragma once
 

@@ -9,7 +9,7 @@
 
 #include <gtest/gtest.h>
 
-#include "platform/testing/process.h"
+#include "tests/support/os/process.h"
 
 namespace testsupport {
 

@@ -1,4 +1,4 @@
-#include "platform/testing/enter_netns.h"
+#include "tests/support/os/enter_netns.h"
 
 #include <fcntl.h>
 #include <sched.h>

@@ -1,4 +1,4 @@
-#include "platform/testing/process.h"
+#include "tests/support/os/process.h"
 
 #include <arpa/inet.h>
 #include <fcntl.h>

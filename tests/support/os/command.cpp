@@ -1,4 +1,4 @@
-#include "platform/testing/command.h"
+#include "tests/support/os/command.h"
 
 #include <fcntl.h>
 #include <spawn.h>
@@ -7,7 +7,7 @@
 
 #include <cerrno>
 
-#include "platform/testing/process.h"
+#include "tests/support/os/process.h"
 
 extern char** environ;
 

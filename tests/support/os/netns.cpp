@@ -1,4 +1,4 @@
-#include "platform/testing/netns.h"
+#include "tests/support/os/netns.h"
 
 #include <fcntl.h>
 #include <sched.h>
@@ -9,7 +9,7 @@
 #include <cstdlib>
 #include <sstream>
 
-#include "platform/testing/command.h"
+#include "tests/support/os/command.h"
 
 namespace platform::testing {
 

@@ -6,8 +6,8 @@
 #include <string>
 
 #include "platform/message.h"
-#include "tests/support/os/netns.h"
 #include "tests/support/PortManagerDoubles.h"
+#include "tests/support/os/netns.h"
 
 namespace {
 

@@ -7,8 +7,8 @@
 
 #include "platform/kernel.h"
 #include "platform/net.h"
-#include "tests/support/os/enter_netns.h"
 #include "tests/support/NatLab.h"
+#include "tests/support/os/enter_netns.h"
 
 namespace {
 

@@ -16,11 +16,11 @@
 
 #include "platform/kernel.h"
 #include "platform/message.h"
+#include "platform/upnp.h"
+#include "portmanager/UpnpDetector.h"
 #include "tests/support/os/command.h"
 #include "tests/support/os/netns.h"
 #include "tests/support/os/process.h"
-#include "platform/upnp.h"
-#include "portmanager/UpnpDetector.h"
 
 namespace {
 

@@ -5,11 +5,11 @@
 #include <string>
 #include <vector>
 
-#include "tests/support/os/process.h"
 #include "stun/STUNClassify.h"
 #include "tests/support/DnsLab.h"
 #include "tests/support/FakeStunServer.h"
 #include "tests/support/LogCapture.h"
+#include "tests/support/os/process.h"
 
 namespace {
 

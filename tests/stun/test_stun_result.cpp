@@ -16,12 +16,12 @@
 #include "platform/kernel.h"
 #include "platform/message.h"
 #include "platform/net.h"
-#include "tests/support/os/process.h"
 #include "stun/STUNClassify.h"
 #include "stun/STUNResult.h"
 #include "tests/support/FakeNetworkInfo.h"
 #include "tests/support/FakeStunServer.h"
 #include "tests/support/Stund.h"
+#include "tests/support/os/process.h"
 
 namespace {
 

@@ -62,29 +62,28 @@ uint32_t GetIPByName(const std::string& name, uint32_t notFoundValue) {
     return 0;
 }
 
-SocketHandle CreateUdpSocket(uint32_t localAddress, uint16_t* port) {
-    const SocketHandle s = platform::OpenUdpSocket();
-    if (s == kInvalidSocket) {
-        return kInvalidSocket;
+Socket CreateUdpSocket(uint32_t localAddress, uint16_t* port) {
+    Socket s = platform::OpenUdpSocket();
+    if (!s) {
+        return s;
     }
     if (port != nullptr && *port != 0) {
-        if (platform::BindSocket(s, localAddress, *port)) {
-            return s;
+        if (!platform::BindSocket(s.Get(), localAddress, *port)) {
+            s.Close();
         }
-        platform::CloseSocket(s);
-        return kInvalidSocket;
+        return s;
     }
     for (int attempt = 0; attempt < kRotatingBindAttempts; ++attempt) {
         const uint16_t candidate = TakeRotatingCandidate();
-        if (platform::BindSocket(s, localAddress, candidate)) {
+        if (platform::BindSocket(s.Get(), localAddress, candidate)) {
             if (port != nullptr) {
                 *port = candidate;
             }
             return s;
         }
     }
-    platform::CloseSocket(s);
-    return kInvalidSocket;
+    s.Close();
+    return s;
 }
 
 int SendDatagram(SocketHandle s, const void* data, size_t length, uint32_t address, uint16_t port) {

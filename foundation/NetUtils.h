@@ -11,6 +11,7 @@
 namespace foundation {
 
 using platform::kInvalidSocket;
+using platform::Socket;
 using platform::SocketHandle;
 
 inline constexpr uint32_t kAddressNone = 0xFFFFFFFFu;
@@ -23,8 +24,8 @@ uint32_t GetIPByName(const std::string& name, uint32_t notFoundValue = 0);
 
 // Binds a new UDP socket on localAddress (host order, 0 for any). port absent or 0 takes the
 // process-wide rotating port (10000..60000); a present 0 receives the bound port. A non-zero
-// port binds exactly that port or fails. Returns kInvalidSocket on failure.
-SocketHandle CreateUdpSocket(uint32_t localAddress, uint16_t* port);
+// port binds exactly that port or fails. The socket is invalid on failure.
+Socket CreateUdpSocket(uint32_t localAddress, uint16_t* port);
 
 // sendto result: bytes sent or the socket error value.
 int SendDatagram(SocketHandle s, const void* data, size_t length, uint32_t address, uint16_t port);

@@ -12,7 +12,7 @@ bool UdpSocket::OpenOn(uint32_t hostAddress) {
     uint16_t port = m_port;
     Close();
     m_socket = CreateUdpSocket(hostAddress, &port);
-    if (m_socket == kInvalidSocket) {
+    if (!m_socket) {
         return false;
     }
     m_port = port;
@@ -34,14 +34,14 @@ bool UdpSocket::Open(const std::string& localAddress, uint16_t port) {
 
 uint32_t UdpSocket::LocalAddress() const {
     uint32_t address = kAddressNone;
-    if (m_socket == kInvalidSocket || !platform::GetSocketName(m_socket, &address, nullptr)) {
+    if (!m_socket || !platform::GetSocketName(m_socket.Get(), &address, nullptr)) {
         return kAddressNone;
     }
     return address;
 }
 
 std::string UdpSocket::LocalAddressText() const {
-    if (m_socket == kInvalidSocket) {
+    if (!m_socket) {
         return {};
     }
     return FormatHostAddress(LocalAddress());
@@ -50,20 +50,21 @@ std::string UdpSocket::LocalAddressText() const {
 std::string UdpSocket::LocalEndpointText() const {
     uint32_t address = 0;
     uint16_t port = 0;
-    if (m_socket == kInvalidSocket || !platform::GetSocketName(m_socket, &address, &port)) {
+    if (!m_socket || !platform::GetSocketName(m_socket.Get(), &address, &port)) {
         return {};
     }
     return FormatHostAddress(address) + ":" + std::to_string(port);
 }
 
 std::string UdpSocket::Receive(std::string& fromAddress, uint16_t& fromPort) {
-    if (m_socket == kInvalidSocket) {
+    if (!m_socket) {
         return {};
     }
     std::vector<char> buffer(kReceiveBuffer);
     uint32_t address = 0;
     uint16_t port = 0;
-    const int n = ReceiveDatagram(m_socket, buffer.data(), buffer.size(), &address, &port, -1);
+    const int n =
+        ReceiveDatagram(m_socket.Get(), buffer.data(), buffer.size(), &address, &port, -1);
     if (n <= 0) {
         return {};
     }
@@ -73,24 +74,23 @@ std::string UdpSocket::Receive(std::string& fromAddress, uint16_t& fromPort) {
 }
 
 bool UdpSocket::SendTo(const std::string& data, uint32_t hostAddress, uint16_t port) {
-    if (m_socket == kInvalidSocket) {
+    if (!m_socket) {
         return false;
     }
-    const int n = SendDatagram(m_socket, data.data(), data.size(), hostAddress, port);
+    const int n = SendDatagram(m_socket.Get(), data.data(), data.size(), hostAddress, port);
     return n >= 0 && static_cast<size_t>(n) == data.size();
 }
 
 bool UdpSocket::SendTo(const std::string& data, const std::string& hostName, uint16_t port) {
-    if (m_socket == kInvalidSocket) {
+    if (!m_socket) {
         return false;
     }
     return SendTo(data, platform::NetToHost32(GetIPByName(hostName, kAddressNone)), port);
 }
 
 void UdpSocket::Close() {
-    if (m_socket != kInvalidSocket) {
-        platform::CloseSocket(m_socket);
-        m_socket = kInvalidSocket;
+    if (m_socket) {
+        m_socket.Close();
         m_port = 0;
     }
 }

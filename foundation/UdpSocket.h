@@ -12,7 +12,6 @@ namespace foundation {
 class UdpSocket {
   public:
     UdpSocket() = default;
-    ~UdpSocket() { Close(); }
     UdpSocket(const UdpSocket&) = delete;
     UdpSocket& operator=(const UdpSocket&) = delete;
 
@@ -24,8 +23,8 @@ class UdpSocket {
     // Sets the object's port first, then as above.
     bool Open(const std::string& localAddress, uint16_t port);
 
-    bool IsValid() const { return m_socket != kInvalidSocket; }
-    SocketHandle Handle() const { return m_socket; }
+    bool IsValid() const { return m_socket.IsValid(); }
+    SocketHandle Handle() const { return m_socket.Get(); }
     uint16_t LocalPort() const { return m_port; }
     // Bound address in host order; kAddressNone when closed.
     uint32_t LocalAddress() const;
@@ -46,7 +45,7 @@ class UdpSocket {
   private:
     bool OpenOn(uint32_t hostAddress);
 
-    SocketHandle m_socket = kInvalidSocket;
+    Socket m_socket;
     uint16_t m_port = 0;
 };
 

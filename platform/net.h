@@ -11,9 +11,48 @@
 
 namespace platform {
 
+// The raw descriptor, as the calls below take it and as records that only carry a socket hold it.
 using SocketHandle = int;
 inline constexpr SocketHandle kInvalidSocket = -1;
 inline constexpr int kSocketError = -1;
+
+// Closes a raw descriptor; kInvalidSocket is ignored. Owners that hold a Socket never call it.
+void CloseSocket(SocketHandle s);
+
+// Owns one socket descriptor: move-only, closed on destruction. Release() hands the descriptor
+// off to a record whose owner closes it explicitly.
+class Socket {
+  public:
+    Socket() noexcept = default;
+    explicit Socket(SocketHandle handle) noexcept : handle_(handle) {}
+    ~Socket() { Close(); }
+    Socket(Socket&& other) noexcept : handle_(other.Release()) {}
+    Socket& operator=(Socket&& other) noexcept {
+        if (this != &other) {
+            Reset(other.Release());
+        }
+        return *this;
+    }
+    Socket(const Socket&) = delete;
+    Socket& operator=(const Socket&) = delete;
+
+    SocketHandle Get() const noexcept { return handle_; }
+    bool IsValid() const noexcept { return handle_ != kInvalidSocket; }
+    explicit operator bool() const noexcept { return IsValid(); }
+    [[nodiscard]] SocketHandle Release() noexcept {
+        const SocketHandle h = handle_;
+        handle_ = kInvalidSocket;
+        return h;
+    }
+    void Reset(SocketHandle handle = kInvalidSocket) noexcept {
+        CloseSocket(handle_);
+        handle_ = handle;
+    }
+    void Close() noexcept { Reset(); }
+
+  private:
+    SocketHandle handle_ = kInvalidSocket;
+};
 
 // Socket error values, named as in Winsock.
 inline constexpr int kErrHostNotFound = 11001;  // WSAHOST_NOT_FOUND
@@ -40,14 +79,13 @@ std::string InetNtoaNet(uint32_t netAddress);
 // Returns 0 on success, otherwise a socket error (kErrHostNotFound when the name is unknown).
 int ResolveHostNameNet(const std::string& name, uint32_t* netAddress);
 
-// An IPv4 datagram socket, or kInvalidSocket.
-SocketHandle OpenUdpSocket();
-// An IPv4 stream socket, or kInvalidSocket.
-SocketHandle OpenTcpSocket();
+// An IPv4 datagram socket; invalid on failure.
+Socket OpenUdpSocket();
+// An IPv4 stream socket; invalid on failure.
+Socket OpenTcpSocket();
 bool SetReuseAddress(SocketHandle s, bool on);
 bool BindSocket(SocketHandle s, uint32_t hostAddress, uint16_t port);
 bool GetSocketName(SocketHandle s, uint32_t* hostAddress, uint16_t* port);
-void CloseSocket(SocketHandle s);
 
 // sendto: bytes sent or kSocketError.
 int SendTo(SocketHandle s, const void* data, size_t length, uint32_t hostAddress, uint16_t port);

@@ -4,6 +4,8 @@
 
 #include <cstddef>
 
+#include "platform/net.h"
+
 namespace platform {
 
 // What arrived since the last read; the two kinds are served separately by the callers.
@@ -18,19 +20,16 @@ struct NetworkChanges {
 class NetworkChangeWatcher {
   public:
     NetworkChangeWatcher();
-    ~NetworkChangeWatcher();
-    NetworkChangeWatcher(const NetworkChangeWatcher&) = delete;
-    NetworkChangeWatcher& operator=(const NetworkChangeWatcher&) = delete;
 
-    bool IsOpen() const { return fd_ >= 0; }
+    bool IsOpen() const { return socket_.IsValid(); }
     // Readable while notifications are queued; -1 when not open.
-    int Descriptor() const { return fd_; }
+    int Descriptor() const { return socket_.Get(); }
     // Reads every queued notification without blocking. When the kernel had to drop some (the
     // receive buffer overflowed), both kinds are reported, since either may have been lost.
     NetworkChanges Read();
 
   private:
-    int fd_;
+    Socket socket_;
 };
 
 // The kinds named by a datagram of the kernel's route notifications. Stops at the first header

@@ -2,6 +2,7 @@
 
 #include <cstdint>
 #include <optional>
+#include <utility>
 
 #include "foundation/Logger.h"
 #include "platform/net.h"
@@ -10,21 +11,6 @@
 namespace portmanager {
 
 namespace {
-
-// Closes the short-lived keep-alive socket on every path out of Refresh.
-class ScopedSocket {
-  public:
-    ScopedSocket() : m_handle(platform::OpenUdpSocket()) {}
-    ~ScopedSocket() { platform::CloseSocket(m_handle); }
-    ScopedSocket(const ScopedSocket&) = delete;
-    ScopedSocket& operator=(const ScopedSocket&) = delete;
-
-    bool IsValid() const { return m_handle != platform::kInvalidSocket; }
-    platform::SocketHandle Get() const { return m_handle; }
-
-  private:
-    platform::SocketHandle m_handle;
-};
 
 // A dotted quad to a host-order address. Anything else gives INADDR_NONE, which is refused
 // outright: Windows cannot bind it, but Linux would bind the broadcast address.
@@ -44,27 +30,27 @@ bool MappedServiceEndpoint::Open(bool anyPort) {
     const bool portFits = anyPort || (m_private.m_port >= 0 && m_private.m_port <= 0xFFFF);
     const uint16_t port = anyPort ? 0 : static_cast<uint16_t>(m_private.m_port);
 
-    m_socket = address && portFits ? platform::OpenUdpSocket() : platform::kInvalidSocket;
-    if (m_socket == platform::kInvalidSocket) {
+    // A record's handle is a copy, never owned here: a failed open leaves it without one.
+    m_socket = platform::kInvalidSocket;
+    if (!address || !portFits) {
         return false;
     }
+    platform::Socket placeholder = platform::OpenUdpSocket();
     // No SO_REUSEADDR: the placeholder must fail on a port anyone else holds.
     uint16_t bound = 0;
-    if (!platform::BindSocket(m_socket, *address, port) ||
-        !platform::GetSocketName(m_socket, nullptr, &bound)) {
-        Close();
+    if (!placeholder || !platform::BindSocket(placeholder.Get(), *address, port) ||
+        !platform::GetSocketName(placeholder.Get(), nullptr, &bound)) {
         return false;
     }
+    // From here the record carries the descriptor; the pool that holds the record closes it.
+    m_socket = placeholder.Release();
     m_private.m_port = bound;
     m_public.m_port = bound;
     return true;
 }
 
 void MappedServiceEndpoint::Close() {
-    if (m_socket != platform::kInvalidSocket) {
-        platform::CloseSocket(m_socket);
-        m_socket = platform::kInvalidSocket;
-    }
+    platform::CloseSocket(std::exchange(m_socket, platform::kInvalidSocket));
 }
 
 std::string MappedServiceEndpoint::ToString() const {
@@ -91,8 +77,8 @@ void PortMapping::Refresh() const {
         platform::NetToHost32(foundation::GetIPByName(m_remote.m_address, 0));
 
     // Failures before the send stay silent: the next tick simply tries again.
-    ScopedSocket socket;
-    if (!socket.IsValid()) {
+    const platform::Socket socket = platform::OpenUdpSocket();
+    if (!socket) {
         return;
     }
     // Shares the port with the client's own socket there (which must allow reuse too).

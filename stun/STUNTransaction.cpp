@@ -14,21 +14,6 @@ constexpr int kMaxWaitMs = 1600;
 constexpr int kRunTestAttempts = 6;
 constexpr int kResponseAddressAttempts = 9;
 
-// Closes its socket on every way out of a transaction.
-class OwnedSocket {
-  public:
-    explicit OwnedSocket(foundation::SocketHandle s) : s_(s) {}
-    ~OwnedSocket() { platform::CloseSocket(s_); }
-    OwnedSocket(const OwnedSocket&) = delete;
-    OwnedSocket& operator=(const OwnedSocket&) = delete;
-
-    foundation::SocketHandle Get() const { return s_; }
-    bool IsValid() const { return s_ != foundation::kInvalidSocket; }
-
-  private:
-    foundation::SocketHandle s_;
-};
-
 int NextWait(int wait) {
     return std::min(wait * 2, kMaxWaitMs);
 }
@@ -42,7 +27,7 @@ bool SameTransaction(const CSTUNMessage& a, const CSTUNMessage& b) {
 bool STUN_RunTest(uint32_t localAddress, uint16_t* localPort, uint32_t serverAddress,
                   uint16_t serverPort, bool changeIp, bool changePort, CSTUNMessage& response,
                   uint32_t& fromAddress, uint16_t& fromPort) {
-    OwnedSocket socket(foundation::CreateUdpSocket(localAddress, localPort));
+    const platform::Socket socket = foundation::CreateUdpSocket(localAddress, localPort);
     if (!socket.IsValid()) {
         return false;
     }
@@ -77,13 +62,13 @@ bool STUN_RunTest(uint32_t localAddress, uint16_t* localPort, uint32_t serverAdd
 bool STUN_RunResponseAddressTest(uint32_t localAddress, uint32_t serverAddress, uint16_t serverPort,
                                  uint32_t responseAddress) {
     uint16_t sendPort = 0;
-    OwnedSocket sender(foundation::CreateUdpSocket(localAddress, &sendPort));
+    const platform::Socket sender = foundation::CreateUdpSocket(localAddress, &sendPort);
     if (!sender.IsValid()) {
         return false;
     }
     // The listening socket must not have sent anything: only an unsolicited datagram counts.
     uint16_t listenPort = 0;
-    OwnedSocket listener(foundation::CreateUdpSocket(localAddress, &listenPort));
+    const platform::Socket listener = foundation::CreateUdpSocket(localAddress, &listenPort);
     if (!listener.IsValid()) {
         return false;
     }

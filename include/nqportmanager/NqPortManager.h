@@ -10,6 +10,7 @@
 // events all arrive through it, and events are fired on it.
 #pragma once
 
+#include <nqportmanager/ComPtr.h>
 #include <nqportmanager/com.h>
 
 enum PM_STATE : int32_t {
@@ -150,3 +151,9 @@ struct IPortMappingProvider : public IUnknown {
                                           LONG privatePort, BSTR publicAddress,
                                           LONG publicPort) = 0;
 };
+
+NQ_DECLARE_COM_IID(IAdvancedPortManager, IID_IAdvancedPortManager);
+NQ_DECLARE_COM_IID(INqDiagnostics, IID_INqDiagnostics);
+NQ_DECLARE_COM_IID(_IAdvancedPortManagerEvents, DIID__IAdvancedPortManagerEvents);
+NQ_DECLARE_COM_IID(IPortManagerUpdateEvent, IID_IPortManagerUpdateEvent);
+NQ_DECLARE_COM_IID(IPortMappingProvider, IID_IPortMappingProvider);

@@ -99,22 +99,20 @@ int ResolveHostNameNet(const std::string& name, uint32_t* netAddress) {
     return result;
 }
 
-SocketHandle OpenUdpSocket() {
+Socket OpenUdpSocket() {
     const int s = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, IPPROTO_UDP);
     if (s < 0) {
         t_lastError = errno;
-        return kInvalidSocket;
     }
-    return s;
+    return Socket(s < 0 ? kInvalidSocket : s);
 }
 
-SocketHandle OpenTcpSocket() {
+Socket OpenTcpSocket() {
     const int s = socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, IPPROTO_TCP);
     if (s < 0) {
         t_lastError = errno;
-        return kInvalidSocket;
     }
-    return s;
+    return Socket(s < 0 ? kInvalidSocket : s);
 }
 
 bool SetReuseAddress(SocketHandle s, bool on) {

@@ -49,28 +49,21 @@ NetworkChanges ParseNetworkChanges(const void* data, size_t length) {
 }
 
 NetworkChangeWatcher::NetworkChangeWatcher()
-    : fd_(socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC | SOCK_NONBLOCK, NETLINK_ROUTE)) {
-    if (fd_ < 0) {
+    : socket_(socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC | SOCK_NONBLOCK, NETLINK_ROUTE)) {
+    if (!socket_) {
         return;
     }
     sockaddr_nl local{};
     local.nl_family = AF_NETLINK;
     local.nl_groups = RTMGRP_IPV4_IFADDR | RTMGRP_IPV4_ROUTE;
-    if (bind(fd_, reinterpret_cast<const sockaddr*>(&local), sizeof local) != 0) {
-        close(fd_);
-        fd_ = -1;
-    }
-}
-
-NetworkChangeWatcher::~NetworkChangeWatcher() {
-    if (fd_ >= 0) {
-        close(fd_);
+    if (bind(socket_.Get(), reinterpret_cast<const sockaddr*>(&local), sizeof local) != 0) {
+        socket_.Close();
     }
 }
 
 NetworkChanges NetworkChangeWatcher::Read() {
     NetworkChanges changes;
-    if (fd_ < 0) {
+    if (!socket_) {
         return changes;
     }
     uint8_t buffer[kReceiveBufferSize];
@@ -82,7 +75,7 @@ NetworkChanges NetworkChangeWatcher::Read() {
         message.msg_namelen = sizeof sender;
         message.msg_iov = &io;
         message.msg_iovlen = 1;
-        const ssize_t n = recvmsg(fd_, &message, 0);
+        const ssize_t n = recvmsg(socket_.Get(), &message, 0);
         if (n < 0) {
             if (errno == EINTR) {
                 continue;

@@ -25,17 +25,11 @@ using foundation::SendDatagram;
 
 constexpr uint32_t kLoopback = 0x7F000001;
 
-// Closes what the test opened.
-struct Socket {
-    explicit Socket(platform::SocketHandle h) : handle(h) {}
-    ~Socket() { platform::CloseSocket(handle); }
-    uint16_t Port() const {
-        uint16_t port = 0;
-        platform::GetSocketName(handle, nullptr, &port);
-        return port;
-    }
-    platform::SocketHandle handle;
-};
+uint16_t PortOf(const platform::Socket& s) {
+    uint16_t port = 0;
+    platform::GetSocketName(s.Get(), nullptr, &port);
+    return port;
+}
 
 TEST(GetIPByName, DottedQuadIsReturnedInNetworkOrderWithoutLookUp) {
     const uint32_t a = GetIPByName("10.1.2.3");
@@ -50,32 +44,31 @@ TEST(GetIPByName, LocalhostResolves) {
 TEST(CreateUdpSocket, RotatingPortsContinueTheSequenceAcrossCallers) {
     foundation::rotating_port::SetNext(40000);
     uint16_t first = 0;
-    Socket a(CreateUdpSocket(kLoopback, &first));
-    ASSERT_NE(a.handle, platform::kInvalidSocket);
+    platform::Socket a(CreateUdpSocket(kLoopback, &first));
+    ASSERT_TRUE(a.IsValid());
     uint16_t second = 0;
-    Socket b(CreateUdpSocket(kLoopback, &second));
-    ASSERT_NE(b.handle, platform::kInvalidSocket);
+    platform::Socket b(CreateUdpSocket(kLoopback, &second));
+    ASSERT_TRUE(b.IsValid());
     EXPECT_GE(first, 40000);
     EXPECT_GT(second, first);
-    EXPECT_EQ(a.Port(), first);
-    EXPECT_EQ(b.Port(), second);
+    EXPECT_EQ(PortOf(a), first);
+    EXPECT_EQ(PortOf(b), second);
     EXPECT_EQ(foundation::rotating_port::Next(), second + 1);
     // An absent port still advances the shared sequence without reporting it.
-    Socket c(CreateUdpSocket(kLoopback, nullptr));
-    ASSERT_NE(c.handle, platform::kInvalidSocket);
-    EXPECT_GT(c.Port(), second);
+    platform::Socket c(CreateUdpSocket(kLoopback, nullptr));
+    ASSERT_TRUE(c.IsValid());
+    EXPECT_GT(PortOf(c), second);
 }
 
 TEST(CreateUdpSocket, WrapsFrom60000To10000) {
     foundation::rotating_port::SetNext(60000);
-    Socket probe(platform::OpenUdpSocket());
-    if (!platform::BindSocket(probe.handle, kLoopback, 60000)) {
+    platform::Socket probe(platform::OpenUdpSocket());
+    if (!platform::BindSocket(probe.Get(), kLoopback, 60000)) {
         GTEST_SKIP() << "port 60000 is in use on this machine";
     }
-    platform::CloseSocket(probe.handle);
-    probe.handle = platform::kInvalidSocket;
+    probe.Close();
     uint16_t port = 0;
-    Socket s(CreateUdpSocket(kLoopback, &port));
+    platform::Socket s(CreateUdpSocket(kLoopback, &port));
     EXPECT_EQ(port, 60000);
     EXPECT_EQ(foundation::rotating_port::Next(), 10000);
 }
@@ -83,43 +76,43 @@ TEST(CreateUdpSocket, WrapsFrom60000To10000) {
 TEST(CreateUdpSocket, FirstUseSeedsACandidateInTheRange) {
     foundation::rotating_port::SetNext(0);
     uint16_t port = 0;
-    Socket s(CreateUdpSocket(kLoopback, &port));
-    ASSERT_NE(s.handle, platform::kInvalidSocket);
+    platform::Socket s(CreateUdpSocket(kLoopback, &port));
+    ASSERT_TRUE(s.IsValid());
     EXPECT_GE(port, 10000);
     EXPECT_LE(port, 60000);
 }
 
 TEST(CreateUdpSocket, TakenExactPortFailsAtOnceAndLeavesTheSequenceAlone) {
     uint16_t taken = 0;
-    Socket holder(CreateUdpSocket(kLoopback, &taken));
-    ASSERT_NE(holder.handle, platform::kInvalidSocket);
+    platform::Socket holder(CreateUdpSocket(kLoopback, &taken));
+    ASSERT_TRUE(holder.IsValid());
     const uint16_t next = foundation::rotating_port::Next();
     uint16_t again = taken;
-    EXPECT_EQ(CreateUdpSocket(kLoopback, &again), platform::kInvalidSocket);
+    EXPECT_FALSE(CreateUdpSocket(kLoopback, &again).IsValid());
     EXPECT_EQ(again, taken);
     EXPECT_EQ(foundation::rotating_port::Next(), next);
 }
 
 TEST(CreateUdpSocket, TakenRotatingCandidateIsSkipped) {
     uint16_t taken = 0;
-    Socket holder(CreateUdpSocket(kLoopback, &taken));
-    ASSERT_NE(holder.handle, platform::kInvalidSocket);
+    platform::Socket holder(CreateUdpSocket(kLoopback, &taken));
+    ASSERT_TRUE(holder.IsValid());
     foundation::rotating_port::SetNext(taken);
     uint16_t port = 0;
-    Socket s(CreateUdpSocket(kLoopback, &port));
-    ASSERT_NE(s.handle, platform::kInvalidSocket);
+    platform::Socket s(CreateUdpSocket(kLoopback, &port));
+    ASSERT_TRUE(s.IsValid());
     EXPECT_NE(port, taken);
 }
 
 TEST(ReceiveDatagram, TimesOutWithoutTouchingTheOutValues) {
     uint16_t port = 0;
-    Socket s(CreateUdpSocket(kLoopback, &port));
+    platform::Socket s(CreateUdpSocket(kLoopback, &port));
     char buf[16];
     uint32_t from = 0xDEADBEEF;
     uint16_t fromPort = 0xBEEF;
-    EXPECT_EQ(ReceiveDatagram(s.handle, buf, sizeof buf, &from, &fromPort, 0), 0);
+    EXPECT_EQ(ReceiveDatagram(s.Get(), buf, sizeof buf, &from, &fromPort, 0), 0);
     const uint64_t start = platform::GetTickCount64();
-    EXPECT_EQ(ReceiveDatagram(s.handle, buf, sizeof buf, &from, &fromPort, 1500), 0);
+    EXPECT_EQ(ReceiveDatagram(s.Get(), buf, sizeof buf, &from, &fromPort, 1500), 0);
     const uint64_t spent = platform::GetTickCount64() - start;
     EXPECT_GE(spent, 1490u);
     EXPECT_LT(spent, 2500u);
@@ -129,15 +122,15 @@ TEST(ReceiveDatagram, TimesOutWithoutTouchingTheOutValues) {
 
 TEST(ReceiveDatagram, ReportsTheSenderInHostOrder) {
     uint16_t rxPort = 0;
-    Socket rx(CreateUdpSocket(kLoopback, &rxPort));
+    platform::Socket rx(CreateUdpSocket(kLoopback, &rxPort));
     uint16_t txPort = 0;
-    Socket tx(CreateUdpSocket(kLoopback, &txPort));
+    platform::Socket tx(CreateUdpSocket(kLoopback, &txPort));
     const char payload[] = {0, 1, 2, 3};
-    ASSERT_EQ(SendDatagram(tx.handle, payload, sizeof payload, kLoopback, rxPort), 4);
+    ASSERT_EQ(SendDatagram(tx.Get(), payload, sizeof payload, kLoopback, rxPort), 4);
     char buf[16] = {};
     uint32_t from = 0;
     uint16_t fromPort = 0;
-    ASSERT_EQ(ReceiveDatagram(rx.handle, buf, sizeof buf, &from, &fromPort, 1000), 4);
+    ASSERT_EQ(ReceiveDatagram(rx.Get(), buf, sizeof buf, &from, &fromPort, 1000), 4);
     EXPECT_EQ(from, kLoopback);
     EXPECT_EQ(fromPort, txPort);
     EXPECT_EQ(std::string(buf, 4), std::string(payload, 4));
@@ -145,14 +138,14 @@ TEST(ReceiveDatagram, ReportsTheSenderInHostOrder) {
 
 TEST(ReceiveDatagram, DatagramLongerThanTheBufferIsAnError) {
     uint16_t rxPort = 0;
-    Socket rx(CreateUdpSocket(kLoopback, &rxPort));
-    Socket tx(CreateUdpSocket(kLoopback, nullptr));
+    platform::Socket rx(CreateUdpSocket(kLoopback, &rxPort));
+    platform::Socket tx(CreateUdpSocket(kLoopback, nullptr));
     const std::string big(100, 'b');
-    SendDatagram(tx.handle, big.data(), big.size(), kLoopback, rxPort);
+    SendDatagram(tx.Get(), big.data(), big.size(), kLoopback, rxPort);
     char buf[10];
     uint32_t from = 0;
     uint16_t fromPort = 0;
-    EXPECT_EQ(ReceiveDatagram(rx.handle, buf, sizeof buf, &from, &fromPort, 1000),
+    EXPECT_EQ(ReceiveDatagram(rx.Get(), buf, sizeof buf, &from, &fromPort, 1000),
               platform::kSocketError);
     EXPECT_EQ(platform::LastSocketError(), platform::kErrMessageSize);
     EXPECT_EQ(fromPort, 0);
@@ -250,11 +243,11 @@ TEST(UdpInDatagrams, SystemCounterGrowsWhenADatagramArrives) {
     uint32_t before = 0;
     ASSERT_EQ(foundation::QueryUdpInDatagrams(&before), 0);
     uint16_t rxPort = 0;
-    Socket rx(CreateUdpSocket(kLoopback, &rxPort));
-    Socket tx(CreateUdpSocket(kLoopback, nullptr));
-    SendDatagram(tx.handle, "x", 1, kLoopback, rxPort);
+    platform::Socket rx(CreateUdpSocket(kLoopback, &rxPort));
+    platform::Socket tx(CreateUdpSocket(kLoopback, nullptr));
+    SendDatagram(tx.Get(), "x", 1, kLoopback, rxPort);
     char buf[4];
-    ASSERT_EQ(ReceiveDatagram(rx.handle, buf, sizeof buf, nullptr, nullptr, 1000), 1);
+    ASSERT_EQ(ReceiveDatagram(rx.Get(), buf, sizeof buf, nullptr, nullptr, 1000), 1);
     uint32_t after = 0;
     ASSERT_EQ(foundation::QueryUdpInDatagrams(&after), 0);
     EXPECT_GT(after, before);

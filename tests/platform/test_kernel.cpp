@@ -53,13 +53,12 @@ TEST(Thread, StopInterruptsEveryKindOfWaitPromptly) {
                 }
                 default: {
                     const auto s = platform::OpenUdpSocket();
-                    platform::BindSocket(s, 0x7F000001, 0);
-                    const int r = platform::WaitSocketReadable(s, 60000);
+                    platform::BindSocket(s.Get(), 0x7F000001, 0);
+                    const int r = platform::WaitSocketReadable(s.Get(), 60000);
                     result = r == platform::kSocketError &&
                                      platform::LastSocketError() == platform::kErrInterrupted
                                  ? static_cast<int>(WaitResult::Stopped)
                                  : r;
-                    platform::CloseSocket(s);
                 }
             }
         }));

@@ -25,23 +25,16 @@ class LoopbackSocket {
   public:
     explicit LoopbackSocket(uint16_t port = 0, bool reuse = false)
         : m_handle(platform::OpenUdpSocket()) {
-        if (m_handle == platform::kInvalidSocket ||
-            (reuse && !platform::SetReuseAddress(m_handle, true)) ||
-            !platform::BindSocket(m_handle, kLoopbackHost, port) ||
-            !platform::GetSocketName(m_handle, nullptr, &m_port)) {
+        if (!m_handle || (reuse && !platform::SetReuseAddress(m_handle.Get(), true)) ||
+            !platform::BindSocket(m_handle.Get(), kLoopbackHost, port) ||
+            !platform::GetSocketName(m_handle.Get(), nullptr, &m_port)) {
             Close();
         }
     }
-    ~LoopbackSocket() { Close(); }
-    LoopbackSocket(const LoopbackSocket&) = delete;
-    LoopbackSocket& operator=(const LoopbackSocket&) = delete;
 
-    bool IsBound() const { return m_handle != platform::kInvalidSocket; }
+    bool IsBound() const { return m_handle.IsValid(); }
     uint16_t Port() const { return m_port; }
-    void Close() {
-        platform::CloseSocket(m_handle);
-        m_handle = platform::kInvalidSocket;
-    }
+    void Close() { m_handle.Close(); }
 
     struct Datagram {
         std::vector<uint8_t> bytes;
@@ -50,12 +43,12 @@ class LoopbackSocket {
     };
     // The timeout only guards against a hang: tests look only for datagrams they expect.
     std::optional<Datagram> Receive(int timeoutMs = 2000) {
-        if (platform::WaitSocketReadable(m_handle, timeoutMs) != 1) {
+        if (platform::WaitSocketReadable(m_handle.Get(), timeoutMs) != 1) {
             return std::nullopt;
         }
         Datagram d;
         d.bytes.resize(2048);
-        const int n = platform::ReceiveFrom(m_handle, d.bytes.data(), d.bytes.size(),
+        const int n = platform::ReceiveFrom(m_handle.Get(), d.bytes.data(), d.bytes.size(),
                                             &d.fromAddress, &d.fromPort);
         if (n < 0) {
             return std::nullopt;
@@ -65,7 +58,7 @@ class LoopbackSocket {
     }
 
   private:
-    platform::SocketHandle m_handle;
+    platform::Socket m_handle;
     uint16_t m_port = 0;
 };
 

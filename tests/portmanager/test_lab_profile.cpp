@@ -21,12 +21,12 @@ TEST(LabProfile, MappingsAreHandedOutAndTheSipServerReceivesKeepAlives) {
     }
     testsupport::NatLab lab(testsupport::NatLab::UniqueName(21), "full-cone-nat");
     ASSERT_TRUE(lab.Up());
-    platform::SocketHandle listener = platform::kInvalidSocket;
+    platform::Socket listener;
     {
         platform::testing::NamedNetnsEntry server(lab.Info("SERVER_NS"));
         ASSERT_TRUE(server.Entered());
         listener = platform::OpenUdpSocket();
-        ASSERT_TRUE(platform::BindSocket(listener, kSipServer, kSipPort));
+        ASSERT_TRUE(platform::BindSocket(listener.Get(), kSipServer, kSipPort));
     }
     const std::string nqpm = std::string(NQPM_BINARY_DIR) + "/bin/nqpm";
     const std::string client = lab.Info("CLIENT_ADDR");
@@ -48,16 +48,15 @@ TEST(LabProfile, MappingsAreHandedOutAndTheSipServerReceivesKeepAlives) {
     EXPECT_EQ(out, expected);
 
     // The first keep-alive of the SIP mapping crossed the NAT from the mapped port.
-    ASSERT_EQ(platform::WaitSocketReadable(listener, 2000), 1);
+    ASSERT_EQ(platform::WaitSocketReadable(listener.Get(), 2000), 1);
     unsigned char buf[64];
     uint32_t from = 0;
     uint16_t fromPort = 0;
-    const int n = platform::ReceiveFrom(listener, buf, sizeof buf, &from, &fromPort);
+    const int n = platform::ReceiveFrom(listener.Get(), buf, sizeof buf, &from, &fromPort);
     EXPECT_EQ(std::vector<unsigned char>(buf, buf + std::max(n, 0)),
               (std::vector<unsigned char>{0, 1, 2, 3}));
     EXPECT_EQ(from, 0xC63364FEu);  // 198.51.100.254
     EXPECT_EQ(fromPort, 5062);
-    platform::CloseSocket(listener);
 }
 
 }  // namespace

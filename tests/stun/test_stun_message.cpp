@@ -395,10 +395,11 @@ TEST(STUNMessageDecode, LogsEachAddressAttributeAtInfo) {
 TEST(STUNMessageSocket, RecvFromTakesAtMost1024Bytes) {
     uint16_t clientPort = 0;
     uint16_t serverPort = 0;
-    const platform::SocketHandle client = foundation::CreateUdpSocket(kLoopback, &clientPort);
-    const platform::SocketHandle server = foundation::CreateUdpSocket(kLoopback, &serverPort);
-    ASSERT_NE(client, platform::kInvalidSocket);
-    ASSERT_NE(server, platform::kInvalidSocket);
+    const platform::Socket clientSocket = foundation::CreateUdpSocket(kLoopback, &clientPort);
+    const platform::Socket serverSocket = foundation::CreateUdpSocket(kLoopback, &serverPort);
+    ASSERT_TRUE(clientSocket && serverSocket);
+    const platform::SocketHandle client = clientSocket.Get();
+    const platform::SocketHandle server = serverSocket.Get();
     for (const auto& [size, accepted] : {std::pair{1024, true}, {1025, false}, {20, false}}) {
         SCOPED_TRACE(size);
         Response r;
@@ -425,8 +426,6 @@ TEST(STUNMessageSocket, RecvFromTakesAtMost1024Bytes) {
     EXPECT_FALSE(m.RecvFrom(client, from, fromPort, 50));
     EXPECT_EQ(std::make_pair(from, fromPort), std::make_pair(0xDEADBEEFu, uint16_t{7}));
     EXPECT_NE(Bytes(m.m_transactionId, m.m_transactionId + 16), before);
-    platform::CloseSocket(client);
-    platform::CloseSocket(server);
 }
 
 }  // namespace

@@ -234,9 +234,9 @@ TEST(STUNTransactionFake, LocalPortArgument) {
 
     // Present and not 0: exactly that port, left as it was. Borrow a free one first.
     uint16_t exact = 0;
-    platform::SocketHandle probe = foundation::CreateUdpSocket(kLoopback, &exact);
-    ASSERT_NE(probe, platform::kInvalidSocket);
-    platform::CloseSocket(probe);
+    platform::Socket probe = foundation::CreateUdpSocket(kLoopback, &exact);
+    ASSERT_TRUE(probe);
+    probe.Close();
     uint16_t asked = exact;
     ASSERT_TRUE(RunTest(fake.Port(), kLoopback, false, false, &asked).ok);
     EXPECT_EQ(asked, exact);
@@ -244,12 +244,12 @@ TEST(STUNTransactionFake, LocalPortArgument) {
 
     // A taken port fails at once, without sending, and no other port is tried.
     probe = foundation::CreateUdpSocket(kLoopback, &exact);
-    ASSERT_NE(probe, platform::kInvalidSocket);
+    ASSERT_TRUE(probe);
     const int before = fake.RequestCount();
     asked = exact;
     EXPECT_FALSE(RunTest(fake.Port(), kLoopback, false, false, &asked).ok);
     EXPECT_EQ(asked, exact);
-    platform::CloseSocket(probe);
+    probe.Close();
     // No local address to bind at all: the same, for both transactions.
     CSTUNMessage response;
     uint32_t from = 0;

@@ -40,13 +40,9 @@ std::optional<std::pair<uint32_t, uint16_t>> FindResponseAddress(const std::vect
 
 FakeStunServer::FakeStunServer(uint32_t address, uint16_t port) : address_(address) {
     socket_ = platform::OpenUdpSocket();
-    if (socket_ == platform::kInvalidSocket) {
-        return;
-    }
-    if (!platform::BindSocket(socket_, address, port) ||
-        !platform::GetSocketName(socket_, nullptr, &port_)) {
-        platform::CloseSocket(socket_);
-        socket_ = platform::kInvalidSocket;
+    if (!socket_ || !platform::BindSocket(socket_.Get(), address, port) ||
+        !platform::GetSocketName(socket_.Get(), nullptr, &port_)) {
+        socket_.Close();
         return;
     }
     answerAddress_ = address_;
@@ -57,8 +53,6 @@ FakeStunServer::FakeStunServer(uint32_t address, uint16_t port) : address_(addre
 FakeStunServer::~FakeStunServer() {
     // The thread's wait ends on the stop request; only then may the sockets go.
     thread_.Stop();
-    platform::CloseSocket(socket_);
-    platform::CloseSocket(answerSocket_);
 }
 
 void FakeStunServer::SetMode(Mode mode) {
@@ -89,16 +83,14 @@ void FakeStunServer::SetChangedAddress(uint32_t address, uint16_t port) {
 }
 
 bool FakeStunServer::AnswerFrom(uint32_t address, uint16_t port) {
-    const platform::SocketHandle s = platform::OpenUdpSocket();
+    platform::Socket s = platform::OpenUdpSocket();
     uint16_t bound = 0;
-    if (s == platform::kInvalidSocket || !platform::BindSocket(s, address, port) ||
-        !platform::GetSocketName(s, nullptr, &bound)) {
-        platform::CloseSocket(s);
+    if (!s || !platform::BindSocket(s.Get(), address, port) ||
+        !platform::GetSocketName(s.Get(), nullptr, &bound)) {
         return false;
     }
     std::lock_guard<std::mutex> lock(mutex_);
-    platform::CloseSocket(answerSocket_);
-    answerSocket_ = s;
+    answerSocket_ = std::move(s);
     answerAddress_ = address;
     answerPort_ = bound;
     return true;
@@ -139,13 +131,13 @@ void FakeStunServer::Run() {
     uint8_t buffer[2048];
     while (!platform::CurrentThreadStopRequested()) {
         // Without a time limit: the owner's stop request ends the wait.
-        const int ready = platform::WaitSocketReadable(socket_, -1);
+        const int ready = platform::WaitSocketReadable(socket_.Get(), -1);
         if (ready != 1) {
             continue;
         }
         Request request;
-        const int n = platform::ReceiveFrom(socket_, buffer, sizeof buffer, &request.fromAddress,
-                                            &request.fromPort);
+        const int n = platform::ReceiveFrom(socket_.Get(), buffer, sizeof buffer,
+                                            &request.fromAddress, &request.fromPort);
         if (n < 0) {
             continue;
         }
@@ -168,8 +160,7 @@ void FakeStunServer::Answer(const Request& request) {
     const auto responseAddress = FindResponseAddress(request.bytes);
     const uint32_t toAddress = responseAddress ? responseAddress->first : request.fromAddress;
     const uint16_t toPort = responseAddress ? responseAddress->second : request.fromPort;
-    const platform::SocketHandle out =
-        answerSocket_ != platform::kInvalidSocket ? answerSocket_ : socket_;
+    const platform::SocketHandle out = answerSocket_ ? answerSocket_.Get() : socket_.Get();
 
     std::vector<uint8_t> answer;
     if (mode_ == Mode::kRaw) {

@@ -74,7 +74,7 @@ class FakeStunServer {
                                        uint32_t fromAddress, uint16_t fromPort,
                                        bool reflected) const;
 
-    platform::SocketHandle socket_ = platform::kInvalidSocket;
+    platform::Socket socket_;
     uint32_t address_ = 0;
     uint16_t port_ = 0;
     bool running_ = false;
@@ -87,7 +87,7 @@ class FakeStunServer {
     std::optional<uint16_t> mappedPort_;
     std::optional<std::pair<uint32_t, uint16_t>> source_;
     std::optional<std::pair<uint32_t, uint16_t>> changed_;
-    platform::SocketHandle answerSocket_ = platform::kInvalidSocket;
+    platform::Socket answerSocket_;
     uint32_t answerAddress_ = 0;
     uint16_t answerPort_ = 0;
     std::vector<Request> requests_;

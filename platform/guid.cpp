@@ -1,4 +1,4 @@
-// Portable: Windows has no UTF-8 GUID formatter either, so this file stays in every build.
+// Not part of Windows (its StringFromGUID2 writes wide characters), so it stays portable.
 #include "nqportmanager/guid.h"
 
 #include <cstdint>

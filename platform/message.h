@@ -63,4 +63,12 @@ bool RunMessageLoopUntil(const std::function<bool()>& done, int timeoutMs);
 void RunMessageLoop();
 void QuitMessageLoop();
 
+// Makes Ctrl-C (SIGINT) and SIGTERM a source of the calling thread's loop: from this call on
+// they no longer end the process; once one arrives, RunMessageLoop and RunMessageLoopUntil on
+// this thread return at once (and so does every later call), and InterruptRequested() is true.
+// Call it before any other thread starts, so that every thread leaves the signals to the loop.
+// False when the signals cannot be redirected.
+bool RouteInterruptsToMessageLoop();
+bool InterruptRequested();
+
 }  // namespace platform

@@ -6,7 +6,7 @@ NQPM_ROOT=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
 # Debian packages the build, the tests and the demo need.
 NQPM_PACKAGES=(
     cmake g++ make pkg-config git
-    googletest libgtest-dev libbenchmark-dev clang-format
+    googletest libgtest-dev libbenchmark-dev clang-format nlohmann-json3-dev
     iproute2 nftables procps
     stun-server stun-client
     libnl-route-3-dev libminiupnpc-dev miniupnpd

@@ -1,12 +1,16 @@
 #include "platform/message.h"
 
+#include <poll.h>
+#include <signal.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
+#include <sys/signalfd.h>
 #include <sys/timerfd.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <atomic>
+#include <cerrno>
 #include <deque>
 #include <memory>
 #include <mutex>
@@ -174,6 +178,19 @@ std::atomic<uintptr_t> g_nextHandle{1};
 
 thread_local std::shared_ptr<Queue> t_queue;
 
+// SIGINT and SIGTERM as a descriptor, once routed; it stays readable from the first signal on, so
+// every loop that watches it ends.
+std::atomic<int> g_interruptFd{-1};
+
+bool InterruptPending() {
+    const int fd = g_interruptFd.load();
+    if (fd < 0) {
+        return false;
+    }
+    pollfd p{fd, POLLIN, 0};
+    return poll(&p, 1, 0) == 1;
+}
+
 Queue& ThisQueue() {
     if (!t_queue) {
         t_queue = std::make_shared<Queue>();
@@ -307,6 +324,9 @@ bool RunMessageLoopUntil(const std::function<bool()>& done, int timeoutMs) {
             q.quit = false;
             return false;
         }
+        if (InterruptPending()) {
+            return done();
+        }
         int wait = -1;
         if (timeoutMs >= 0) {
             const uint64_t now = GetTickCount64();
@@ -328,6 +348,33 @@ void RunMessageLoop() {
 
 void QuitMessageLoop() {
     ThisQueue().quit = true;
+}
+
+bool RouteInterruptsToMessageLoop() {
+    static const int fd = [] {
+        sigset_t set;
+        sigemptyset(&set);
+        sigaddset(&set, SIGINT);
+        sigaddset(&set, SIGTERM);
+        // Blocked in every thread started later, so the signal stays pending for the descriptor.
+        if (pthread_sigmask(SIG_BLOCK, &set, nullptr) != 0) {
+            return -1;
+        }
+        return signalfd(-1, &set, SFD_CLOEXEC | SFD_NONBLOCK);
+    }();
+    if (fd < 0) {
+        return false;
+    }
+    g_interruptFd.store(fd);
+    // The calling thread's loop wakes on it; a second call on the same thread adds nothing.
+    epoll_event ev{};
+    ev.events = EPOLLIN;
+    ev.data.fd = fd;
+    return epoll_ctl(ThisQueue().Descriptor(), EPOLL_CTL_ADD, fd, &ev) == 0 || errno == EEXIST;
+}
+
+bool InterruptRequested() {
+    return InterruptPending();
 }
 
 }  // namespace platform

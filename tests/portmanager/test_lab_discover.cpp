@@ -4,7 +4,7 @@
 
 #include <string>
 
-#include "tests/support/JsonField.h"
+#include "tests/support/Json.h"
 #include "tests/support/NatLab.h"
 
 namespace {
@@ -31,7 +31,7 @@ const Expectation kBehaviours[] = {
 constexpr const char* kSipProxy = "sip.example.net:5060";
 constexpr const char* kMediaProxy = "media.example.net";
 
-using testsupport::JsonField;
+using testsupport::ParseJson;
 
 std::string Discover(const testsupport::NatLab& lab) {
     std::string out;
@@ -53,16 +53,16 @@ TEST_P(LabDiscover, NoGatewayGoesOnToStunAndRecommendsForTheLabsBehaviour) {
     testsupport::NatLab lab(testsupport::NatLab::UniqueName(GetParam()), e.behaviour);
     ASSERT_TRUE(lab.Up());
     const std::string out = Discover(lab);
+    nlohmann::json j = ParseJson(out);
     const std::string client = lab.Info("CLIENT_ADDR");
-    EXPECT_EQ(JsonField(out, "state"), "PMS_COMPLETED") << out;
-    EXPECT_EQ(JsonField(out, "topology"), e.topology) << out;
-    EXPECT_EQ(JsonField(out, "private"), client) << out;
-    EXPECT_EQ(JsonField(out, "public"), e.publicIsBox ? lab.Info("PUBLIC_ADDR") : client) << out;
-    EXPECT_EQ(JsonField(out, "recommended_sip_server"), e.viaSipProxy ? kSipProxy : kMediaProxy)
-        << out;
-    EXPECT_EQ(JsonField(out, "client_name_suffix"), e.stunSuffix ? "STUN" : "") << out;
-    EXPECT_EQ(JsonField(out, "recommended_upnp_enabled"), "false") << out;
-    EXPECT_EQ(JsonField(out, "recommended_port_manager"), "true") << out;
+    EXPECT_EQ(j["state"], "PMS_COMPLETED") << out;
+    EXPECT_EQ(j["topology"], e.topology) << out;
+    EXPECT_EQ(j["private"], client) << out;
+    EXPECT_EQ(j["public"], e.publicIsBox ? lab.Info("PUBLIC_ADDR") : client) << out;
+    EXPECT_EQ(j["recommended_sip_server"], e.viaSipProxy ? kSipProxy : kMediaProxy) << out;
+    EXPECT_EQ(j["client_name_suffix"], e.stunSuffix ? "STUN" : "") << out;
+    EXPECT_EQ(j["recommended_upnp_enabled"], false) << out;
+    EXPECT_EQ(j["recommended_port_manager"], true) << out;
 }
 
 INSTANTIATE_TEST_SUITE_P(Behaviours, LabDiscover,
@@ -85,15 +85,16 @@ TEST_P(LabDiscoverUpnp, RealGatewayGivesTheUpnpTopologyAndTheSipProxy) {
                             {"--upnp"});
     ASSERT_TRUE(lab.Up());
     const std::string out = Discover(lab);
-    EXPECT_EQ(JsonField(out, "state"), "PMS_COMPLETED") << out;
-    EXPECT_EQ(JsonField(out, "topology"), "PMT_UPNP_ENABLED_NAT_OR_FIREWALL") << out;
-    EXPECT_EQ(JsonField(out, "topology_code"), "9") << out;
-    EXPECT_EQ(JsonField(out, "recommended_sip_server"), kSipProxy) << out;
-    EXPECT_EQ(JsonField(out, "recommended_upnp_enabled"), "true") << out;
-    EXPECT_EQ(JsonField(out, "client_name_suffix"), "") << out;
+    nlohmann::json j = ParseJson(out);
+    EXPECT_EQ(j["state"], "PMS_COMPLETED") << out;
+    EXPECT_EQ(j["topology"], "PMT_UPNP_ENABLED_NAT_OR_FIREWALL") << out;
+    EXPECT_EQ(j["topology_code"], 9) << out;
+    EXPECT_EQ(j["recommended_sip_server"], kSipProxy) << out;
+    EXPECT_EQ(j["recommended_upnp_enabled"], true) << out;
+    EXPECT_EQ(j["client_name_suffix"], "") << out;
     // A first discovery that found a gateway has learnt no address.
-    EXPECT_EQ(JsonField(out, "private"), "") << out;
-    EXPECT_EQ(JsonField(out, "recommended_port_manager"), "false") << out;
+    EXPECT_EQ(j["private"], "") << out;
+    EXPECT_EQ(j["recommended_port_manager"], false) << out;
 }
 
 INSTANTIATE_TEST_SUITE_P(Gateways, LabDiscoverUpnp,

@@ -8,7 +8,7 @@
 
 #include "tests/support/os/command.h"
 
-#include "tests/support/JsonField.h"
+#include "tests/support/Json.h"
 #include "tests/support/NatLab.h"
 
 namespace {
@@ -31,7 +31,7 @@ const Expectation kBehaviours[] = {
     {"blocked", "STUN_RESULT_BLOCKED", false, false},
 };
 
-using testsupport::JsonField;
+using testsupport::ParseJson;
 
 class LabClassify : public ::testing::TestWithParam<int> {};
 
@@ -48,14 +48,15 @@ TEST_P(LabClassify, NqpmClassifyNamesTheLabsBehaviourAndPublicAddress) {
                                lab.Info("CLIENT_ADDR"), "--json"},
                               &out),
               0);
-    EXPECT_EQ(JsonField(out, "local"), lab.Info("CLIENT_ADDR")) << out;
-    EXPECT_EQ(JsonField(out, "result"), e.result) << out;
+    const nlohmann::json results = ParseJson(out)["results"];
+    ASSERT_EQ(results.size(), 1u) << out;
+    const nlohmann::json& r = results[0];
+    EXPECT_EQ(r["local"], lab.Info("CLIENT_ADDR")) << out;
+    EXPECT_EQ(r["result"], e.result) << out;
     if (!e.hasPublic) {
-        EXPECT_EQ(JsonField(out, "public"), "null") << out;
-    } else if (e.publicIsClient) {
-        EXPECT_EQ(JsonField(out, "public"), lab.Info("CLIENT_ADDR")) << out;
+        EXPECT_TRUE(r["public"].is_null()) << out;
     } else {
-        EXPECT_EQ(JsonField(out, "public"), lab.Info("PUBLIC_ADDR")) << out;
+        EXPECT_EQ(r["public"], lab.Info(e.publicIsClient ? "CLIENT_ADDR" : "PUBLIC_ADDR")) << out;
     }
 }
 

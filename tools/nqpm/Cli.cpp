@@ -8,6 +8,7 @@
 #include "foundation/NetUtils.h"
 #include "platform/console.h"
 #include "platform/kernel.h"
+#include "platform/message.h"
 
 namespace nqpm {
 
@@ -177,90 +178,19 @@ void Progress(const std::string& text) {
     }
 }
 
-std::string JsonQuote(const std::string& text) {
-    std::string out = "\"";
-    for (const char c : text) {
-        switch (c) {
-            case '"':
-                out += "\\\"";
-                break;
-            case '\\':
-                out += "\\\\";
-                break;
-            case '\n':
-                out += "\\n";
-                break;
-            case '\r':
-                out += "\\r";
-                break;
-            case '\t':
-                out += "\\t";
-                break;
-            default:
-                if (static_cast<unsigned char>(c) < 0x20) {
-                    char buf[8];
-                    std::snprintf(buf, sizeof buf, "\\u%04x", static_cast<unsigned>(c));
-                    out += buf;
-                } else {
-                    out += c;
-                }
-        }
+void PrintJson(const Json& value) {
+    const std::string text = value.dump(-1, ' ', false, Json::error_handler_t::replace);
+    std::printf("%s\n", text.c_str());
+}
+
+Json OptionalText(const std::optional<std::string>& value) {
+    return value ? Json(*value) : Json(nullptr);
+}
+
+void RouteInterrupts() {
+    if (!platform::RouteInterruptsToMessageLoop()) {
+        throw std::runtime_error("cannot watch for Ctrl-C and SIGTERM");
     }
-    return out + "\"";
-}
-
-std::string JsonArray(const std::vector<std::string>& jsonItems) {
-    std::string out = "[";
-    for (size_t i = 0; i < jsonItems.size(); ++i) {
-        out += (i == 0 ? "" : ",") + jsonItems[i];
-    }
-    return out + "]";
-}
-
-void JsonObject::Key(const std::string& key) {
-    if (!body_.empty()) {
-        body_ += ",";
-    }
-    body_ += JsonQuote(key) + ":";
-}
-
-JsonObject& JsonObject::Add(const std::string& key, const std::string& value) {
-    Key(key);
-    body_ += JsonQuote(value);
-    return *this;
-}
-
-JsonObject& JsonObject::Add(const std::string& key, const char* value) {
-    return Add(key, std::string(value));
-}
-
-JsonObject& JsonObject::Add(const std::string& key, int64_t value) {
-    Key(key);
-    body_ += std::to_string(value);
-    return *this;
-}
-
-JsonObject& JsonObject::Add(const std::string& key, bool value) {
-    Key(key);
-    body_ += value ? "true" : "false";
-    return *this;
-}
-
-JsonObject& JsonObject::AddNull(const std::string& key) {
-    Key(key);
-    body_ += "null";
-    return *this;
-}
-
-JsonObject& JsonObject::AddRaw(const std::string& key, const std::string& json) {
-    Key(key);
-    body_ += json;
-    return *this;
-}
-
-JsonObject& JsonObject::AddOptional(const std::string& key,
-                                    const std::optional<std::string>& value) {
-    return value ? Add(key, *value) : AddNull(key);
 }
 
 }  // namespace nqpm

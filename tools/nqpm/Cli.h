@@ -8,6 +8,8 @@
 #include <string>
 #include <vector>
 
+#include <nlohmann/json.hpp>
+
 namespace nqpm {
 
 inline constexpr int kExitOk = 0;
@@ -68,25 +70,14 @@ void ConfigureLogging(const Options& options);
 // Prints "nqpm: <text>" on stderr, only when stderr is a terminal.
 void Progress(const std::string& text);
 
-// A JSON object written key by key, in insertion order.
-class JsonObject {
-  public:
-    JsonObject& Add(const std::string& key, const std::string& value);
-    JsonObject& Add(const std::string& key, const char* value);
-    JsonObject& Add(const std::string& key, int64_t value);
-    JsonObject& Add(const std::string& key, bool value);
-    JsonObject& AddNull(const std::string& key);
-    // value must already be valid JSON (an object or an array).
-    JsonObject& AddRaw(const std::string& key, const std::string& json);
-    // A string, or null when absent.
-    JsonObject& AddOptional(const std::string& key, const std::optional<std::string>& value);
-    std::string Str() const { return "{" + body_ + "}"; }
+// JSON output keeps its keys in insertion order.
+using Json = nlohmann::ordered_json;
+// One compact object per line on stdout; invalid UTF-8 in a text becomes U+FFFD.
+void PrintJson(const Json& value);
+// A text, or null when absent.
+Json OptionalText(const std::optional<std::string>& value);
 
-  private:
-    void Key(const std::string& key);
-    std::string body_;
-};
-std::string JsonQuote(const std::string& text);
-std::string JsonArray(const std::vector<std::string>& jsonItems);
+// Makes Ctrl-C and SIGTERM end the calling thread's message loop (before any thread starts).
+void RouteInterrupts();
 
 }  // namespace nqpm

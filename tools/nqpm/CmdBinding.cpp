@@ -63,19 +63,16 @@ int RunBinding(int argc, char** argv) {
     const auto reflected = AddressText(response.m_reflectedFrom, stun::STUN_REFLECTED_FROM);
 
     if (options.Json()) {
-        JsonObject o;
-        o.Add("local_port", static_cast<int64_t>(localPort));
-        if (answered) {
-            o.AddOptional("mapped", mapped)
-                .AddOptional("source", source)
-                .AddOptional("changed", changed)
-                .AddOptional("reflected", reflected);
-            o.Add("from", stun::FormatHostOrderAddress(from) + ":" + std::to_string(fromPort));
-        } else {
-            o.AddNull("mapped").AddNull("source").AddNull("changed").AddNull("reflected");
-            o.AddNull("from");
-        }
-        std::printf("%s\n", o.Str().c_str());
+        Json o;
+        o["local_port"] = localPort;
+        o["mapped"] = answered ? OptionalText(mapped) : nullptr;
+        o["source"] = answered ? OptionalText(source) : nullptr;
+        o["changed"] = answered ? OptionalText(changed) : nullptr;
+        o["reflected"] = answered ? OptionalText(reflected) : nullptr;
+        o["from"] = answered
+                        ? Json(stun::FormatHostOrderAddress(from) + ":" + std::to_string(fromPort))
+                        : Json(nullptr);
+        PrintJson(o);
     } else if (answered) {
         const auto show = [](const std::optional<std::string>& v) {
             return v ? v->c_str() : "(absent)";

@@ -2,7 +2,6 @@
 #include <cstdio>
 
 #include "foundation/NetUtils.h"
-#include "platform/console.h"
 #include "platform/message.h"
 #include "stun/STUNClassify.h"
 #include "stun/STUNResult.h"
@@ -38,6 +37,7 @@ class PassWindow final : public platform::MessageWindow {
 
 // One pass of the result service over every usable local address.
 bool ClassifyAll(const std::string& servers, stun::STUNResultList& list) {
+    RouteInterrupts();
     PassWindow window;
     if (!window.CreateMessageWindow()) {
         return false;
@@ -47,9 +47,7 @@ bool ClassifyAll(const std::string& servers, stun::STUNResultList& list) {
         std::fprintf(stderr, "nqpm classify: the STUN service did not start\n");
         return false;
     }
-    platform::InterruptDescriptor();
-    platform::RunMessageLoopUntil([&] { return window.ended || platform::InterruptRequested(); },
-                                  -1);
+    platform::RunMessageLoopUntil([&] { return window.ended; }, -1);
     const bool ok = window.ended && service.GetSTUNResult(&list);
     service.Stop();
     return ok;
@@ -57,26 +55,24 @@ bool ClassifyAll(const std::string& servers, stun::STUNResultList& list) {
 
 }  // namespace
 
-std::string ClassificationJson(const stun::STUNResultList& list) {
-    std::vector<std::string> results;
+Json ClassificationJson(const stun::STUNResultList& list) {
+    Json results = Json::array();
     for (int32_t i = 0; i < list.count && i < static_cast<int32_t>(stun::kMaxSTUNResults); ++i) {
         const auto& e = list.entries[i];
-        JsonObject o;
-        o.Add("local", stun::FormatHostOrderAddress(e.localAddress));
         const char* name = stun::STUNResultName(e.stunResult);
-        o.Add("result", name != nullptr ? name : "invalid");
-        o.Add("code", static_cast<int64_t>(e.stunResult));
-        if (e.publicAddress == stun::kNoPublicAddress) {
-            o.AddNull("public");
-        } else {
-            o.Add("public", stun::FormatHostOrderAddress(e.publicAddress));
-        }
-        results.push_back(o.Str());
+        Json o;
+        o["local"] = stun::FormatHostOrderAddress(e.localAddress);
+        o["result"] = name != nullptr ? name : "invalid";
+        o["code"] = static_cast<int64_t>(e.stunResult);
+        o["public"] = e.publicAddress == stun::kNoPublicAddress
+                          ? Json(nullptr)
+                          : Json(stun::FormatHostOrderAddress(e.publicAddress));
+        results.push_back(std::move(o));
     }
-    JsonObject top;
-    top.AddRaw("results", JsonArray(results));
-    top.Add("text", stun::FormatSTUNResults(list));
-    return top.Str();
+    Json top;
+    top["results"] = std::move(results);
+    top["text"] = stun::FormatSTUNResults(list);
+    return top;
 }
 
 int RunClassify(int argc, char** argv) {
@@ -97,8 +93,11 @@ int RunClassify(int argc, char** argv) {
         if (!ClassifyAll(servers, list)) {
             return kExitFailed;
         }
-        std::printf("%s\n", options.Json() ? ClassificationJson(list).c_str()
-                                           : stun::FormatSTUNResults(list).c_str());
+        if (options.Json()) {
+            PrintJson(ClassificationJson(list));
+        } else {
+            std::printf("%s\n", stun::FormatSTUNResults(list).c_str());
+        }
         return kExitOk;
     }
 
@@ -120,7 +119,7 @@ int RunClassify(int argc, char** argv) {
     stun::STUN_GetResult(server, stun::kSTUNPort, list.entries[0]);
 
     if (options.Json()) {
-        std::printf("%s\n", ClassificationJson(list).c_str());
+        PrintJson(ClassificationJson(list));
     } else {
         std::printf("%s\n", stun::FormatSTUNResults(list).c_str());
     }

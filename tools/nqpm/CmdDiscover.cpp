@@ -36,14 +36,16 @@ int RunDiscover(int argc, char** argv) {
     if (!session.Run(discovery)) {
         return kExitFailed;
     }
-    std::printf("%s%s",
-                options.Json() ? session.ReportJson().c_str() : session.ReportText().c_str(),
-                options.Json() ? "\n" : "");
+    if (options.Json()) {
+        PrintJson(session.ReportJson());
+    } else {
+        std::printf("%s", session.ReportText().c_str());
+    }
     std::fflush(stdout);
     if (options.Has("watch")) {
         session.OnNetworkChange([&] {
             if (options.Json()) {
-                std::printf("{\"event\":\"PME_NETWORK_CHANGE\"}\n");
+                PrintJson(Json{{"event", "PME_NETWORK_CHANGE"}});
             } else {
                 std::printf("network change (PME_NETWORK_CHANGE)\n");
             }

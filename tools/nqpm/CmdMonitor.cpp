@@ -8,7 +8,6 @@
 
 #include "foundation/NetUtils.h"
 #include "foundation/NetworkChangeMonitor.h"
-#include "platform/console.h"
 #include "platform/kernel.h"
 #include "platform/message.h"
 #include "tools/nqpm/Cli.h"
@@ -26,7 +25,6 @@ const char* const kUsage =
     "is {\"event\":\"start\"|\"addresses-changed\"|\"route-changed\",\"addresses\":[...]}.\n";
 
 constexpr platform::UINT kWmChange = platform::WM_USER + 1;
-constexpr platform::UINT kWmInterrupt = platform::WM_USER + 2;
 
 struct Change {
     const char* event;
@@ -66,13 +64,11 @@ class ChangeQueue : public foundation::INetworkChangeSink {
 
 void Print(bool json, const Change& change) {
     if (json) {
-        std::vector<std::string> items;
+        Json addresses = Json::array();
         for (uint32_t a : change.addresses) {
-            items.push_back(JsonQuote(foundation::FormatHostAddress(a)));
+            addresses.push_back(foundation::FormatHostAddress(a));
         }
-        JsonObject o;
-        o.Add("event", change.event).AddRaw("addresses", JsonArray(items));
-        std::printf("%s\n", o.Str().c_str());
+        PrintJson(Json{{"event", change.event}, {"addresses", std::move(addresses)}});
     } else {
         std::string line = std::string(change.event) + ":";
         for (uint32_t a : change.addresses) {
@@ -110,7 +106,6 @@ class MonitorWindow : public platform::MessageWindow {
     explicit MonitorWindow(bool json) : json_(json) {}
 
     void SetQueue(ChangeQueue* queue) { queue_ = queue; }
-    bool Interrupted() const { return interrupted_; }
 
     platform::LRESULT WindowProc(platform::UINT message, platform::WPARAM, platform::LPARAM,
                                  bool& handled) override {
@@ -118,8 +113,6 @@ class MonitorWindow : public platform::MessageWindow {
             for (const Change& c : queue_->Take()) {
                 Print(json_, c);
             }
-        } else if (message == kWmInterrupt) {
-            interrupted_ = true;
         } else {
             handled = false;
         }
@@ -129,7 +122,6 @@ class MonitorWindow : public platform::MessageWindow {
   private:
     const bool json_;
     ChangeQueue* queue_ = nullptr;
-    bool interrupted_ = false;
 };
 
 }  // namespace
@@ -142,12 +134,7 @@ int RunMonitor(int argc, char** argv) {
         return kExitOk;
     }
     ConfigureLogging(options);
-    // Before any thread starts, so that every thread leaves SIGINT and SIGTERM to it.
-    const int interrupt = platform::InterruptDescriptor();
-    if (interrupt < 0) {
-        std::fprintf(stderr, "nqpm monitor: cannot watch for Ctrl-C and SIGTERM\n");
-        return kExitFailed;
-    }
+    RouteInterrupts();
 
     MonitorWindow window(options.Json());
     if (!window.CreateMessageWindow()) {
@@ -164,19 +151,7 @@ int RunMonitor(int argc, char** argv) {
     }
     Print(options.Json(), {"start", monitor.GetLocalIPs()});
     Progress("watching address and route changes; Ctrl-C ends");
-
-    // The loop waits on the message queue only; this thread turns the interrupt into a message.
-    platform::Thread interruptWatch;
-    const platform::WindowHandle handle = window.Handle();
-    if (!interruptWatch.Start([interrupt, handle] {
-            if (platform::WaitReadable(interrupt, -1) == platform::WaitResult::Signaled) {
-                platform::PostMessage(handle, kWmInterrupt, 0, 0);
-            }
-        })) {
-        std::fprintf(stderr, "nqpm monitor: cannot start a thread\n");
-        return kExitFailed;
-    }
-    platform::RunMessageLoopUntil([&window] { return window.Interrupted(); }, -1);
+    platform::RunMessageLoop();  // until Ctrl-C or SIGTERM
     return kExitOk;
 }
 

@@ -81,16 +81,15 @@ int RunProfile(int argc, char** argv) {
     VariantClear(&list);
     if (FAILED(hr)) {
         if (options.Json()) {
-            std::printf("{\"hresult\":\"%s\"}\n", Hex(hr).c_str());
+            PrintJson(Json{{"hresult", Hex(hr)}});
         } else {
             std::printf("OnBeforeEnableProfileEx failed: %s\n", Hex(hr).c_str());
         }
         return kExitFailed;
     }
 
-    IPortMappingProvider* provider = nullptr;
-    pm->QueryInterface(IID_IPortMappingProvider, reinterpret_cast<void**>(&provider));
-    JsonObject json;
+    const auto provider = ComPtr<IAdvancedPortManager>(pm).As<IPortMappingProvider>();
+    Json json;
     for (const Kind& kind : kKinds) {
         BStr privateAddress;
         BStr publicAddress;
@@ -103,9 +102,9 @@ int RunProfile(int argc, char** argv) {
         const std::string pub = publicAddress.Utf8() + ":" + std::to_string(publicPort);
         if (options.Json()) {
             if (SUCCEEDED(got)) {
-                json.AddRaw(kind.key, JsonObject().Add("private", priv).Add("public", pub).Str());
+                json[kind.key] = Json{{"private", priv}, {"public", pub}};
             } else {
-                json.AddNull(kind.key);
+                json[kind.key] = nullptr;
             }
         } else if (SUCCEEDED(got)) {
             std::printf("%-11s private %-21s public %s\n", kind.key, priv.c_str(), pub.c_str());
@@ -113,10 +112,9 @@ int RunProfile(int argc, char** argv) {
             std::printf("%-11s none (%s)\n", kind.key, Hex(got).c_str());
         }
     }
-    provider->Release();
     if (options.Json()) {
-        json.Add("hresult", Hex(hr));
-        std::printf("%s\n", json.Str().c_str());
+        json["hresult"] = Hex(hr);
+        PrintJson(json);
     }
     std::fflush(stdout);
     if (duration > 0) {

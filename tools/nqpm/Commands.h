@@ -1,7 +1,7 @@
 // The nqpm subcommands. Each takes the arguments after its name and returns the exit code.
 #pragma once
 
-#include <string>
+#include "tools/nqpm/Cli.h"
 
 #include "stun/STUNResults.h"
 
@@ -14,6 +14,6 @@ int RunProfile(int argc, char** argv);
 int RunMonitor(int argc, char** argv);
 
 // {"results":[{"local":..,"result":..,"code":..,"public":..|null}],"text":..}
-std::string ClassificationJson(const stun::STUNResultList& list);
+Json ClassificationJson(const stun::STUNResultList& list);
 
 }  // namespace nqpm

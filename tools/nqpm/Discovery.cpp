@@ -2,7 +2,6 @@
 
 #include <cstdio>
 
-#include "platform/console.h"
 #include "platform/kernel.h"
 #include "platform/message.h"
 #include "portmanager/AdvancedPortManager.h"
@@ -18,13 +17,18 @@ std::string Text(HRESULT (IAdvancedPortManager::*getter)(BSTR*), IAdvancedPortMa
 }
 
 bool PortManagerRecommended(IAdvancedPortManager* pm) {
-    IUnknown* unk = nullptr;
-    pm->get_RecommendedPortManager(&unk);
-    if (unk == nullptr) {
-        return false;
+    ComPtr<IUnknown> unk;
+    pm->get_RecommendedPortManager(unk.GetAddressOf());
+    return static_cast<bool>(unk);
+}
+
+// The connection point of the port manager's events, or empty.
+ComPtr<IConnectionPoint> EventsPoint(const ComPtr<IAdvancedPortManager>& pm) {
+    ComPtr<IConnectionPoint> point;
+    if (const auto container = pm.As<IConnectionPointContainer>()) {
+        container->FindConnectionPoint(DIID__IAdvancedPortManagerEvents, point.GetAddressOf());
     }
-    unk->Release();
-    return true;
+    return point;
 }
 
 }  // namespace
@@ -83,22 +87,13 @@ DiscoveryOptions ReadDiscoveryOptions(const Options& options) {
 Discovery::Discovery() = default;
 
 Discovery::~Discovery() {
-    if (m_pm != nullptr) {
+    if (m_pm) {
         if (m_cookie != 0) {
-            IConnectionPointContainer* container = nullptr;
-            if (SUCCEEDED(m_pm->QueryInterface(IID_IConnectionPointContainer,
-                                               reinterpret_cast<void**>(&container)))) {
-                IConnectionPoint* point = nullptr;
-                if (SUCCEEDED(
-                        container->FindConnectionPoint(DIID__IAdvancedPortManagerEvents, &point))) {
-                    point->Unadvise(m_cookie);
-                    point->Release();
-                }
-                container->Release();
+            if (const auto point = EventsPoint(m_pm)) {
+                point->Unadvise(m_cookie);
             }
         }
         m_pm->Shutdown();
-        m_pm->Release();
     }
 }
 
@@ -129,20 +124,20 @@ int Discovery::Events(PM_EVENT type) const {
 }
 
 bool Discovery::Run(const DiscoveryOptions& options) {
+    RouteInterrupts();
     HRESULT hr = portmanager::CAdvancedPortManager::CreateInstance(IID_IAdvancedPortManager,
-                                                                   reinterpret_cast<void**>(&m_pm));
+                                                                   m_pm.GetVoidAddressOf());
     if (FAILED(hr)) {
         std::fprintf(stderr, "nqpm: cannot create the port manager (0x%08X)\n",
                      static_cast<unsigned>(hr));
         return false;
     }
-    IConnectionPointContainer* container = nullptr;
-    IConnectionPoint* point = nullptr;
-    m_pm->QueryInterface(IID_IConnectionPointContainer, reinterpret_cast<void**>(&container));
-    container->FindConnectionPoint(DIID__IAdvancedPortManagerEvents, &point);
-    point->Advise(static_cast<_IAdvancedPortManagerEvents*>(this), &m_cookie);
-    point->Release();
-    container->Release();
+    const auto point = EventsPoint(m_pm);
+    if (!point ||
+        FAILED(point->Advise(static_cast<_IAdvancedPortManagerEvents*>(this), &m_cookie))) {
+        std::fprintf(stderr, "nqpm: cannot connect to the port manager's events\n");
+        return false;
+    }
 
     BStr servers(options.stunServers);
     BStr sip(options.sipProxy);
@@ -156,11 +151,14 @@ bool Discovery::Run(const DiscoveryOptions& options) {
         return false;
     }
     Progress("discovering the path to the Internet (UPnP gateway, then STUN)");
-    platform::InterruptDescriptor();
-    const bool done = platform::RunMessageLoopUntil(
-        [this] { return m_events[PME_UPDATED] > 0 || platform::InterruptRequested(); },
-        static_cast<int>(options.timeoutSeconds * 1000));
-    if (!done || m_events[PME_UPDATED] == 0) {
+    const bool done =
+        platform::RunMessageLoopUntil([this] { return m_events[PME_UPDATED] > 0; },
+                                      static_cast<int>(options.timeoutSeconds * 1000));
+    if (!done && platform::InterruptRequested()) {
+        std::fprintf(stderr, "nqpm: interrupted before the discovery reported\n");
+        return false;
+    }
+    if (!done) {
         std::fprintf(stderr, "nqpm: no discovery outcome within %.0f s\n", options.timeoutSeconds);
         return false;
     }
@@ -168,7 +166,7 @@ bool Discovery::Run(const DiscoveryOptions& options) {
 }
 
 void Discovery::PumpFor(double seconds) {
-    platform::RunMessageLoopUntil([] { return platform::InterruptRequested(); },
+    platform::RunMessageLoopUntil([] { return false; },
                                   seconds < 0 ? -1 : static_cast<int>(seconds * 1000));
 }
 
@@ -179,11 +177,11 @@ Discovery::Report Discovery::Read() const {
     m_pm->get_Topology(&r.topology);
     m_pm->get_RecommendedUpnpEnabled(&upnp);
     r.upnp = upnp != VARIANT_FALSE;
-    r.privateAddress = Text(&IAdvancedPortManager::get_PrivateIpAddress, m_pm);
-    r.publicAddress = Text(&IAdvancedPortManager::get_PublicIpAddress, m_pm);
-    r.sipServer = Text(&IAdvancedPortManager::get_RecommendedSipServer, m_pm);
-    r.suffix = Text(&IAdvancedPortManager::get_ClientNameSuffix, m_pm);
-    r.portManager = PortManagerRecommended(m_pm);
+    r.privateAddress = Text(&IAdvancedPortManager::get_PrivateIpAddress, m_pm.Get());
+    r.publicAddress = Text(&IAdvancedPortManager::get_PublicIpAddress, m_pm.Get());
+    r.sipServer = Text(&IAdvancedPortManager::get_RecommendedSipServer, m_pm.Get());
+    r.suffix = Text(&IAdvancedPortManager::get_ClientNameSuffix, m_pm.Get());
+    r.portManager = PortManagerRecommended(m_pm.Get());
     return r;
 }
 
@@ -202,19 +200,17 @@ std::string Discovery::ReportText() const {
     return out;
 }
 
-std::string Discovery::ReportJson() const {
+Json Discovery::ReportJson() const {
     const Report r = Read();
-    JsonObject o;
-    o.Add("state", StateName(r.state))
-        .Add("topology", TopologyName(r.topology))
-        .Add("topology_code", static_cast<int64_t>(r.topology))
-        .Add("private", r.privateAddress)
-        .Add("public", r.publicAddress)
-        .Add("recommended_sip_server", r.sipServer)
-        .Add("recommended_upnp_enabled", r.upnp)
-        .Add("client_name_suffix", r.suffix)
-        .Add("recommended_port_manager", r.portManager);
-    return o.Str();
+    return Json{{"state", StateName(r.state)},
+                {"topology", TopologyName(r.topology)},
+                {"topology_code", static_cast<int64_t>(r.topology)},
+                {"private", r.privateAddress},
+                {"public", r.publicAddress},
+                {"recommended_sip_server", r.sipServer},
+                {"recommended_upnp_enabled", r.upnp},
+                {"client_name_suffix", r.suffix},
+                {"recommended_port_manager", r.portManager}};
 }
 
 }  // namespace nqpm

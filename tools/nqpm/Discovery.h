@@ -38,10 +38,10 @@ class Discovery final : public _IAdvancedPortManagerEvents {
     // Pumps until the time passes or Ctrl-C / SIGTERM; -1 waits for the interrupt only.
     void PumpFor(double seconds);
 
-    IAdvancedPortManager* PortManager() const { return m_pm; }
+    IAdvancedPortManager* PortManager() const { return m_pm.Get(); }
     // The state, topology, addresses and recommendations, as text lines or one JSON object.
     std::string ReportText() const;
-    std::string ReportJson() const;
+    Json ReportJson() const;
 
     int Events(PM_EVENT type) const;
     // Called for every PME_NETWORK_CHANGE after the first update.
@@ -67,7 +67,7 @@ class Discovery final : public _IAdvancedPortManagerEvents {
     };
     Report Read() const;
 
-    IAdvancedPortManager* m_pm = nullptr;
+    ComPtr<IAdvancedPortManager> m_pm;
     DWORD m_cookie = 0;
     int m_events[4] = {0, 0, 0, 0};
     std::function<void()> m_onNetworkChange;

@@ -1,6 +1,5 @@
 #include "foundation/NetUtils.h"
 
-#include <atomic>
 #include <cstdlib>
 #include <vector>
 
@@ -14,13 +13,15 @@ namespace {
 constexpr uint16_t kFirstRotatingPort = 10000;
 constexpr uint16_t kLastRotatingPort = 60000;
 constexpr int kRotatingBindAttempts = 100;
+}  // namespace
 
-// Shared by every thread; atomic so that two callers never race on the value itself (they may
-// still both try a port, and one bind then fails, which costs one attempt).
-std::atomic<uint16_t> g_nextPort{0};
+RotatingPort& RotatingPort::Shared() {
+    static RotatingPort ports;
+    return ports;
+}
 
-uint16_t TakeRotatingCandidate() {
-    uint16_t current = g_nextPort.load();
+uint16_t RotatingPort::Take() {
+    uint16_t current = m_next.load();
     for (;;) {
         uint16_t candidate = current;
         if (candidate == 0) {
@@ -29,21 +30,11 @@ uint16_t TakeRotatingCandidate() {
         }
         const uint16_t next = candidate >= kLastRotatingPort ? kFirstRotatingPort
                                                              : static_cast<uint16_t>(candidate + 1);
-        if (g_nextPort.compare_exchange_weak(current, next)) {
+        if (m_next.compare_exchange_weak(current, next)) {
             return candidate;
         }
     }
 }
-}  // namespace
-
-namespace rotating_port {
-uint16_t Next() {
-    return g_nextPort.load();
-}
-void SetNext(uint16_t port) {
-    g_nextPort.store(port);
-}
-}  // namespace rotating_port
 
 uint32_t GetIPByName(const std::string& name, uint32_t notFoundValue) {
     const uint32_t dotted = platform::InetAddrNet(name);
@@ -62,7 +53,7 @@ uint32_t GetIPByName(const std::string& name, uint32_t notFoundValue) {
     return 0;
 }
 
-Socket CreateUdpSocket(uint32_t localAddress, uint16_t* port) {
+Socket CreateUdpSocket(uint32_t localAddress, uint16_t* port, RotatingPort& ports) {
     Socket s = platform::OpenUdpSocket();
     if (!s) {
         return s;
@@ -74,7 +65,7 @@ Socket CreateUdpSocket(uint32_t localAddress, uint16_t* port) {
         return s;
     }
     for (int attempt = 0; attempt < kRotatingBindAttempts; ++attempt) {
-        const uint16_t candidate = TakeRotatingCandidate();
+        const uint16_t candidate = ports.Take();
         if (platform::BindSocket(s.Get(), localAddress, candidate)) {
             if (port != nullptr) {
                 *port = candidate;

@@ -42,41 +42,41 @@ TEST(GetIPByName, LocalhostResolves) {
 }
 
 TEST(CreateUdpSocket, RotatingPortsContinueTheSequenceAcrossCallers) {
-    foundation::rotating_port::SetNext(40000);
+    foundation::RotatingPort ports(40000);
     uint16_t first = 0;
-    platform::Socket a(CreateUdpSocket(kLoopback, &first));
+    platform::Socket a(CreateUdpSocket(kLoopback, &first, ports));
     ASSERT_TRUE(a.IsValid());
     uint16_t second = 0;
-    platform::Socket b(CreateUdpSocket(kLoopback, &second));
+    platform::Socket b(CreateUdpSocket(kLoopback, &second, ports));
     ASSERT_TRUE(b.IsValid());
     EXPECT_GE(first, 40000);
     EXPECT_GT(second, first);
     EXPECT_EQ(PortOf(a), first);
     EXPECT_EQ(PortOf(b), second);
-    EXPECT_EQ(foundation::rotating_port::Next(), second + 1);
-    // An absent port still advances the shared sequence without reporting it.
-    platform::Socket c(CreateUdpSocket(kLoopback, nullptr));
+    EXPECT_EQ(ports.Next(), second + 1);
+    // An absent port still advances the sequence without reporting it.
+    platform::Socket c(CreateUdpSocket(kLoopback, nullptr, ports));
     ASSERT_TRUE(c.IsValid());
     EXPECT_GT(PortOf(c), second);
 }
 
 TEST(CreateUdpSocket, WrapsFrom60000To10000) {
-    foundation::rotating_port::SetNext(60000);
+    foundation::RotatingPort ports(60000);
     platform::Socket probe(platform::OpenUdpSocket());
     if (!platform::BindSocket(probe.Get(), kLoopback, 60000)) {
         GTEST_SKIP() << "port 60000 is in use on this machine";
     }
     probe.Close();
     uint16_t port = 0;
-    platform::Socket s(CreateUdpSocket(kLoopback, &port));
+    platform::Socket s(CreateUdpSocket(kLoopback, &port, ports));
     EXPECT_EQ(port, 60000);
-    EXPECT_EQ(foundation::rotating_port::Next(), 10000);
+    EXPECT_EQ(ports.Next(), 10000);
 }
 
 TEST(CreateUdpSocket, FirstUseSeedsACandidateInTheRange) {
-    foundation::rotating_port::SetNext(0);
+    foundation::RotatingPort ports;
     uint16_t port = 0;
-    platform::Socket s(CreateUdpSocket(kLoopback, &port));
+    platform::Socket s(CreateUdpSocket(kLoopback, &port, ports));
     ASSERT_TRUE(s.IsValid());
     EXPECT_GE(port, 10000);
     EXPECT_LE(port, 60000);
@@ -86,20 +86,20 @@ TEST(CreateUdpSocket, TakenExactPortFailsAtOnceAndLeavesTheSequenceAlone) {
     uint16_t taken = 0;
     platform::Socket holder(CreateUdpSocket(kLoopback, &taken));
     ASSERT_TRUE(holder.IsValid());
-    const uint16_t next = foundation::rotating_port::Next();
+    foundation::RotatingPort ports(40000);
     uint16_t again = taken;
-    EXPECT_FALSE(CreateUdpSocket(kLoopback, &again).IsValid());
+    EXPECT_FALSE(CreateUdpSocket(kLoopback, &again, ports).IsValid());
     EXPECT_EQ(again, taken);
-    EXPECT_EQ(foundation::rotating_port::Next(), next);
+    EXPECT_EQ(ports.Next(), 40000);
 }
 
 TEST(CreateUdpSocket, TakenRotatingCandidateIsSkipped) {
     uint16_t taken = 0;
     platform::Socket holder(CreateUdpSocket(kLoopback, &taken));
     ASSERT_TRUE(holder.IsValid());
-    foundation::rotating_port::SetNext(taken);
+    foundation::RotatingPort ports(taken);
     uint16_t port = 0;
-    platform::Socket s(CreateUdpSocket(kLoopback, &port));
+    platform::Socket s(CreateUdpSocket(kLoopback, &port, ports));
     ASSERT_TRUE(s.IsValid());
     EXPECT_NE(port, taken);
 }

@@ -5,7 +5,6 @@
 
 #include "foundation/Logger.h"
 #include "platform/kernel.h"
-#include "platform/netinfo.h"
 
 namespace foundation {
 
@@ -102,9 +101,9 @@ int ReceiveDatagram(SocketHandle s, void* buffer, size_t capacity, uint32_t* fro
     return n;
 }
 
-int32_t QueryUdpInDatagrams(uint32_t* count) {
+int32_t QueryUdpInDatagrams(uint32_t* count, platform::NetworkInfo& info) {
     uint32_t value = 0;
-    const int error = platform::CurrentNetworkInfo().UdpInDatagrams(value);
+    const int error = info.UdpInDatagrams(value);
     if (error != 0) {
         return static_cast<int32_t>(0x80070000u | (static_cast<uint32_t>(error) & 0xFFFFu));
     }
@@ -113,9 +112,9 @@ int32_t QueryUdpInDatagrams(uint32_t* count) {
 }
 
 bool GetInterfaceAddressAndGateway(uint32_t interfaceIndex, std::string& address,
-                                   std::string& gateway) {
+                                   std::string& gateway, platform::NetworkInfo& info) {
     std::vector<platform::AdapterInfo> adapters;
-    if (!platform::CurrentNetworkInfo().Adapters(adapters)) {
+    if (!info.Adapters(adapters)) {
         return false;
     }
     for (const auto& a : adapters) {
@@ -128,9 +127,9 @@ bool GetInterfaceAddressAndGateway(uint32_t interfaceIndex, std::string& address
     return false;
 }
 
-std::string GetGatewayForLocalAddress(const std::string& address) {
+std::string GetGatewayForLocalAddress(const std::string& address, platform::NetworkInfo& info) {
     std::vector<platform::AdapterInfo> adapters;
-    if (!platform::CurrentNetworkInfo().Adapters(adapters)) {
+    if (!info.Adapters(adapters)) {
         return {};
     }
     for (const auto& a : adapters) {

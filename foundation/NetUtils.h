@@ -8,6 +8,7 @@
 #include <string>
 
 #include "platform/net.h"
+#include "platform/netinfo.h"
 
 namespace foundation {
 
@@ -63,13 +64,16 @@ int ReceiveDatagram(SocketHandle s, void* buffer, size_t capacity, uint32_t* fro
                     uint16_t* fromPort, int timeoutMs);
 
 // The host-wide count of UDP datagrams received. Returns 0 (S_OK) or 0x80070000 | error.
-int32_t QueryUdpInDatagrams(uint32_t* count);
+int32_t QueryUdpInDatagrams(uint32_t* count,
+                            platform::NetworkInfo& info = platform::SystemNetworkInfo());
 
 // Adapter queries: an adapter is an interface, its first IPv4 address is its primary address
 // and its gateway is the gateway of a default route through it.
 bool GetInterfaceAddressAndGateway(uint32_t interfaceIndex, std::string& address,
-                                   std::string& gateway);
-std::string GetGatewayForLocalAddress(const std::string& address);
+                                   std::string& gateway,
+                                   platform::NetworkInfo& info = platform::SystemNetworkInfo());
+std::string GetGatewayForLocalAddress(const std::string& address,
+                                      platform::NetworkInfo& info = platform::SystemNetworkInfo());
 
 // Dotted text of a host-order address.
 std::string FormatHostAddress(uint32_t hostAddress);

@@ -209,33 +209,34 @@ TEST_F(AdapterQueries, GatewayComesFromTheFirstAdapterWhosePrimaryAddressMatches
                      {2, "eth0", {"10.0.0.2", "10.0.0.3"}, "10.0.0.1"},
                      {3, "eth1", {"10.0.0.3"}, "10.0.0.254"},
                      {4, "eth2", {"192.0.2.5"}, ""}};
-    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.2"), "10.0.0.1");
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.2", fake), "10.0.0.1");
     // A secondary address does not count; the adapter where it is primary does.
-    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.3"), "10.0.0.254");
-    EXPECT_EQ(foundation::GetGatewayForLocalAddress("192.0.2.5"), "");
-    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.02"), "");  // byte-wise comparison
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.3", fake), "10.0.0.254");
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("192.0.2.5", fake), "");
+    // Compared byte by byte.
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.02", fake), "");
     fake.ok = false;
-    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.2"), "");
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.2", fake), "");
 }
 
 TEST_F(AdapterQueries, InterfaceAddressAndGatewayNeedBothIndexAndGateway) {
     fake.adapters = {{4, "eth2", {"192.0.2.5"}, ""}, {7, "eth0", {"10.0.0.2"}, "10.0.0.1"}};
     std::string address = "x";
     std::string gateway = "y";
-    EXPECT_FALSE(foundation::GetInterfaceAddressAndGateway(4, address, gateway));
+    EXPECT_FALSE(foundation::GetInterfaceAddressAndGateway(4, address, gateway, fake));
     EXPECT_EQ(address, "x");
-    ASSERT_TRUE(foundation::GetInterfaceAddressAndGateway(7, address, gateway));
+    ASSERT_TRUE(foundation::GetInterfaceAddressAndGateway(7, address, gateway, fake));
     EXPECT_EQ(address, "10.0.0.2");
     EXPECT_EQ(gateway, "10.0.0.1");
 }
 
 TEST_F(AdapterQueries, UdpCounterErrorBecomesAWin32Result) {
     uint32_t count = 0;
-    EXPECT_EQ(foundation::QueryUdpInDatagrams(&count), 0);
+    EXPECT_EQ(foundation::QueryUdpInDatagrams(&count, fake), 0);
     EXPECT_EQ(count, 42u);
     fake.udpError = 0x12345;
     count = 7;
-    EXPECT_EQ(static_cast<uint32_t>(foundation::QueryUdpInDatagrams(&count)), 0x80072345u);
+    EXPECT_EQ(static_cast<uint32_t>(foundation::QueryUdpInDatagrams(&count, fake)), 0x80072345u);
     EXPECT_EQ(count, 7u);
 }
 

@@ -1,12 +1,10 @@
 #include "foundation/NetUtils.h"
 
-#include <atomic>
 #include <cstdlib>
 #include <vector>
 
 #include "foundation/Logger.h"
 #include "platform/kernel.h"
-#include "platform/netinfo.h"
 
 namespace foundation {
 
@@ -14,13 +12,15 @@ namespace {
 constexpr uint16_t kFirstRotatingPort = 10000;
 constexpr uint16_t kLastRotatingPort = 60000;
 constexpr int kRotatingBindAttempts = 100;
+}  // namespace
 
-// Shared by every thread; atomic so that two callers never race on the value itself (they may
-// still both try a port, and one bind then fails, which costs one attempt).
-std::atomic<uint16_t> g_nextPort{0};
+RotatingPort& RotatingPort::Shared() {
+    static RotatingPort ports;
+    return ports;
+}
 
-uint16_t TakeRotatingCandidate() {
-    uint16_t current = g_nextPort.load();
+uint16_t RotatingPort::Take() {
+    uint16_t current = m_next.load();
     for (;;) {
         uint16_t candidate = current;
         if (candidate == 0) {
@@ -29,21 +29,11 @@ uint16_t TakeRotatingCandidate() {
         }
         const uint16_t next = candidate >= kLastRotatingPort ? kFirstRotatingPort
                                                              : static_cast<uint16_t>(candidate + 1);
-        if (g_nextPort.compare_exchange_weak(current, next)) {
+        if (m_next.compare_exchange_weak(current, next)) {
             return candidate;
         }
     }
 }
-}  // namespace
-
-namespace rotating_port {
-uint16_t Next() {
-    return g_nextPort.load();
-}
-void SetNext(uint16_t port) {
-    g_nextPort.store(port);
-}
-}  // namespace rotating_port
 
 uint32_t GetIPByName(const std::string& name, uint32_t notFoundValue) {
     const uint32_t dotted = platform::InetAddrNet(name);
@@ -62,7 +52,7 @@ uint32_t GetIPByName(const std::string& name, uint32_t notFoundValue) {
     return 0;
 }
 
-Socket CreateUdpSocket(uint32_t localAddress, uint16_t* port) {
+Socket CreateUdpSocket(uint32_t localAddress, uint16_t* port, RotatingPort& ports) {
     Socket s = platform::OpenUdpSocket();
     if (!s) {
         return s;
@@ -74,7 +64,7 @@ Socket CreateUdpSocket(uint32_t localAddress, uint16_t* port) {
         return s;
     }
     for (int attempt = 0; attempt < kRotatingBindAttempts; ++attempt) {
-        const uint16_t candidate = TakeRotatingCandidate();
+        const uint16_t candidate = ports.Take();
         if (platform::BindSocket(s.Get(), localAddress, candidate)) {
             if (port != nullptr) {
                 *port = candidate;
@@ -111,9 +101,9 @@ int ReceiveDatagram(SocketHandle s, void* buffer, size_t capacity, uint32_t* fro
     return n;
 }
 
-int32_t QueryUdpInDatagrams(uint32_t* count) {
+int32_t QueryUdpInDatagrams(uint32_t* count, platform::NetworkInfo& info) {
     uint32_t value = 0;
-    const int error = platform::CurrentNetworkInfo().UdpInDatagrams(value);
+    const int error = info.UdpInDatagrams(value);
     if (error != 0) {
         return static_cast<int32_t>(0x80070000u | (static_cast<uint32_t>(error) & 0xFFFFu));
     }
@@ -122,9 +112,9 @@ int32_t QueryUdpInDatagrams(uint32_t* count) {
 }
 
 bool GetInterfaceAddressAndGateway(uint32_t interfaceIndex, std::string& address,
-                                   std::string& gateway) {
+                                   std::string& gateway, platform::NetworkInfo& info) {
     std::vector<platform::AdapterInfo> adapters;
-    if (!platform::CurrentNetworkInfo().Adapters(adapters)) {
+    if (!info.Adapters(adapters)) {
         return false;
     }
     for (const auto& a : adapters) {
@@ -137,9 +127,9 @@ bool GetInterfaceAddressAndGateway(uint32_t interfaceIndex, std::string& address
     return false;
 }
 
-std::string GetGatewayForLocalAddress(const std::string& address) {
+std::string GetGatewayForLocalAddress(const std::string& address, platform::NetworkInfo& info) {
     std::vector<platform::AdapterInfo> adapters;
-    if (!platform::CurrentNetworkInfo().Adapters(adapters)) {
+    if (!info.Adapters(adapters)) {
         return {};
     }
     for (const auto& a : adapters) {

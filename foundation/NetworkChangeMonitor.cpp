@@ -5,7 +5,6 @@
 #include "foundation/Logger.h"
 #include "foundation/NetUtils.h"
 #include "platform/netchange.h"
-#include "platform/netinfo.h"
 
 namespace foundation {
 
@@ -15,7 +14,7 @@ constexpr uint32_t kLoopbackAddress = 0x7F000001u;
 constexpr uint32_t kBroadcastAddress = 0xFFFFFFFFu;
 }  // namespace
 
-CNetworkChangeMonitor::CNetworkChangeMonitor() = default;
+CNetworkChangeMonitor::CNetworkChangeMonitor(platform::NetworkInfo& info) : m_info(info) {}
 
 CNetworkChangeMonitor::~CNetworkChangeMonitor() {
     Stop();
@@ -88,7 +87,7 @@ void CNetworkChangeMonitor::RefreshLocalIPs() {
     platform::CriticalSectionLock lock(m_lock);
     std::vector<uint32_t>().swap(m_localIPs);
     std::vector<platform::AddressRow> table;
-    if (!platform::CurrentNetworkInfo().AddressTable(table)) {
+    if (!m_info.AddressTable(table)) {
         return;
     }
     for (const auto& row : table) {
@@ -97,7 +96,7 @@ void CNetworkChangeMonitor::RefreshLocalIPs() {
             continue;
         }
         // Only an interface's first address with a default gateway counts.
-        if (!GetGatewayForLocalAddress(FormatHostAddress(address)).empty()) {
+        if (!GetGatewayForLocalAddress(FormatHostAddress(address), m_info).empty()) {
             m_localIPs.push_back(address);
         }
     }

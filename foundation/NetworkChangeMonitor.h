@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "platform/kernel.h"
+#include "platform/netinfo.h"
 
 namespace platform {
 class NetworkChangeWatcher;
@@ -33,7 +34,8 @@ class CNetworkChangeMonitor {
     // Lets a burst of changes settle before the address table is read.
     static constexpr int kSettleMs = 1000;
 
-    CNetworkChangeMonitor();
+    // Reads the address table and gateways from info, which outlives the monitor.
+    explicit CNetworkChangeMonitor(platform::NetworkInfo& info = platform::SystemNetworkInfo());
     ~CNetworkChangeMonitor();
     CNetworkChangeMonitor(const CNetworkChangeMonitor&) = delete;
     CNetworkChangeMonitor& operator=(const CNetworkChangeMonitor&) = delete;
@@ -61,6 +63,7 @@ class CNetworkChangeMonitor {
     // The settle pause, a rebuild and one callback pass; false when asked to stop in the pause.
     bool SettleAndNotify(void (INetworkChangeSink::*callback)());
 
+    platform::NetworkInfo& m_info;
     std::vector<uint32_t> m_localIPs;
     std::vector<INetworkChangeSink*> m_sinks;
     mutable platform::CriticalSection m_lock;  // both lists, and held during callback passes

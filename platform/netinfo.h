@@ -20,7 +20,7 @@ struct AddressRow {
     uint32_t interfaceIndex = 0;
 };
 
-// The source of these answers. Tests that must control them install a double.
+// The source of these answers. Objects that read them take one; tests pass a double.
 class NetworkInfo {
   public:
     virtual ~NetworkInfo() = default;
@@ -32,10 +32,7 @@ class NetworkInfo {
     virtual int UdpInDatagrams(uint32_t& count) = 0;
 };
 
+// The system's answers; the default wherever a NetworkInfo is taken.
 NetworkInfo& SystemNetworkInfo();
-// The installed double, or the system's.
-NetworkInfo& CurrentNetworkInfo();
-// Installs a double (null restores the system's). The caller keeps it alive while installed.
-void InstallNetworkInfo(NetworkInfo* info);
 
 }  // namespace platform

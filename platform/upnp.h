@@ -9,7 +9,7 @@ namespace platform {
 // and one control request on the LAN.
 inline constexpr int kUpnpSearchMs = 1000;
 
-// The source of the answer. Tests that must control it install a double.
+// The source of the answer. Objects that ask take one; tests pass a double.
 class UpnpGatewayProbe {
   public:
     virtual ~UpnpGatewayProbe() = default;
@@ -20,10 +20,7 @@ class UpnpGatewayProbe {
     virtual bool GatewayPresent() = 0;
 };
 
+// The system's probe; the default wherever a probe is taken.
 UpnpGatewayProbe& SystemUpnpGatewayProbe();
-// The installed double, or the system's.
-UpnpGatewayProbe& CurrentUpnpGatewayProbe();
-// Installs a double (null restores the system's). The caller keeps it alive while installed.
-void InstallUpnpGatewayProbe(UpnpGatewayProbe* probe);
 
 }  // namespace platform

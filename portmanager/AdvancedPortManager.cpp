@@ -22,9 +22,10 @@ constexpr uint32_t kLastDiagnosableRange = 0x80EF02BBu;
 PortManagerServices PortManagerServices::Default() {
     PortManagerServices s;
     s.createStunService = [](const char* servers, platform::WindowHandle window,
-                             platform::UINT message, platform::WPARAM wParam) {
+                             platform::UINT message, platform::WPARAM wParam,
+                             platform::NetworkInfo& networkInfo) {
         return std::unique_ptr<stun::ISTUNResult>(
-            new (std::nothrow) stun::CSTUNResult(servers, window, message, wParam));
+            new (std::nothrow) stun::CSTUNResult(servers, window, message, wParam, networkInfo));
     };
     return s;
 }
@@ -49,7 +50,9 @@ HRESULT CAdvancedPortManager::CreateInstance(REFIID riid, void** ppv,
 }
 
 CAdvancedPortManager::CAdvancedPortManager(PortManagerServices services)
-    : m_services(std::move(services)) {
+    : m_services(std::move(services)),
+      m_upnpDetector(*m_services.upnpProbe),
+      m_monitor(*m_services.networkInfo) {
     ResetToDefaults();
 }
 
@@ -266,8 +269,8 @@ HRESULT CAdvancedPortManager::InitializeEx2(BSTR bstrStunServerName, LONG lStart
     m_monitor.Start();
 
     if (m_services.createStunService) {
-        m_pStunResult =
-            m_services.createStunService(m_stunServer->c_str(), Handle(), WM_PM_STUN_REFRESH, 0);
+        m_pStunResult = m_services.createStunService(
+            m_stunServer->c_str(), Handle(), WM_PM_STUN_REFRESH, 0, *m_services.networkInfo);
     }
     Refresh();
     return S_OK;
@@ -365,7 +368,7 @@ HRESULT CAdvancedPortManager::get_UDPPacketsIn(LONG* pVal) {
         return E_POINTER;
     }
     uint32_t count = 0;
-    const int32_t hr = foundation::QueryUdpInDatagrams(&count);
+    const int32_t hr = foundation::QueryUdpInDatagrams(&count, *m_services.networkInfo);
     if (FAILED(hr)) {
         return hr;
     }

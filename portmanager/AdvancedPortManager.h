@@ -14,6 +14,8 @@
 
 #include "foundation/NetworkChangeMonitor.h"
 #include "platform/message.h"
+#include "platform/netinfo.h"
+#include "platform/upnp.h"
 #include "portmanager/ConnectionPoint.h"
 #include "portmanager/Dispatch.h"
 #include "portmanager/PortMapping.h"
@@ -33,10 +35,16 @@ inline constexpr uint32_t kShutdownTimerPeriodMs = 1000;
 inline constexpr uint32_t kKeepAlivePeriodMs = 30000;
 inline constexpr uint32_t kEarlyKeepAliveMs = 200;
 
-// What the port manager builds on, replaceable where a test must control the answers.
+// What the port manager builds on, replaceable where a test must control the answers. The
+// system's by default; whatever is given outlives the port manager.
 struct PortManagerServices {
+    // Addresses, gateways and the UDP counter, for the port manager and its STUN service.
+    platform::NetworkInfo* networkInfo = &platform::SystemNetworkInfo();
+    platform::UpnpGatewayProbe* upnpProbe = &platform::SystemUpnpGatewayProbe();
+    // Empty: no STUN service. Default() creates the real one.
     std::function<std::unique_ptr<stun::ISTUNResult>(const char* servers, platform::WindowHandle,
-                                                     platform::UINT, platform::WPARAM)>
+                                                     platform::UINT, platform::WPARAM,
+                                                     platform::NetworkInfo&)>
         createStunService;
 
     static PortManagerServices Default();

@@ -1,7 +1,5 @@
 #include "portmanager/UpnpDetector.h"
 
-#include "platform/upnp.h"
-
 namespace portmanager {
 
 UpnpDetector::~UpnpDetector() {
@@ -29,8 +27,7 @@ HRESULT UpnpDetector::Start(platform::WindowHandle window, platform::UINT messag
     m_notifyWindow = window;
     m_notifyMessage = message;
     m_notifyParameter = parameter;
-    platform::UpnpGatewayProbe& probe = platform::CurrentUpnpGatewayProbe();
-    if (!m_thread.Start([this, &probe] { DetectThread(probe); })) {
+    if (!m_thread.Start([this] { DetectThread(); })) {
         // The owner waits for this message before it goes on: without a thread, report no
         // gateway so that it falls back to STUN.
         Finish(false);
@@ -38,8 +35,8 @@ HRESULT UpnpDetector::Start(platform::WindowHandle window, platform::UINT messag
     return S_OK;
 }
 
-void UpnpDetector::DetectThread(platform::UpnpGatewayProbe& probe) {
-    Finish(probe.GatewayPresent());
+void UpnpDetector::DetectThread() {
+    Finish(m_probe.GatewayPresent());
 }
 
 void UpnpDetector::Finish(bool found) {

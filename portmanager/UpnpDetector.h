@@ -9,16 +9,15 @@
 
 #include "platform/kernel.h"
 #include "platform/message.h"
-
-namespace platform {
-class UpnpGatewayProbe;
-}
+#include "platform/upnp.h"
 
 namespace portmanager {
 
 class UpnpDetector {
   public:
-    UpnpDetector() = default;
+    // Asks probe, which outlives the detector.
+    explicit UpnpDetector(platform::UpnpGatewayProbe& probe = platform::SystemUpnpGatewayProbe())
+        : m_probe(probe) {}
     // Ends a detection still running (it gives up at its next chance, within about a second)
     // and waits for it; no message is posted once destruction has begun.
     virtual ~UpnpDetector();
@@ -35,10 +34,11 @@ class UpnpDetector {
     bool IsUpnpFound() const { return m_found.load(); }
 
   private:
-    void DetectThread(platform::UpnpGatewayProbe& probe);
+    void DetectThread();
     // Reports the outcome unless the detector is being destroyed; ends the detection.
     void Finish(bool found);
 
+    platform::UpnpGatewayProbe& m_probe;
     platform::WindowHandle m_notifyWindow = nullptr;
     platform::UINT m_notifyMessage = 0;
     platform::WPARAM m_notifyParameter = 0;

@@ -16,8 +16,8 @@ constexpr uint32_t kWaitFailed = 0xFFFFFFFFu;  // WAIT_FAILED
 }  // namespace
 
 CSTUNResult::CSTUNResult(const char* servers, platform::WindowHandle window, platform::UINT message,
-                         platform::WPARAM wParam)
-    : m_window(window), m_message(message), m_wParam(wParam) {
+                         platform::WPARAM wParam, platform::NetworkInfo& networkInfo)
+    : m_monitor(networkInfo), m_window(window), m_message(message), m_wParam(wParam) {
     NQ_TRACE_ENTERED("CSTUNResult::CSTUNResult");
     if (servers == nullptr) {
         NQ_LOG("CSTUNResult::CSTUNResult", foundation::kLogError,

@@ -12,6 +12,7 @@
 #include "nqportmanager/com.h"
 #include "platform/kernel.h"
 #include "platform/message.h"
+#include "platform/netinfo.h"
 #include "stun/STUNResults.h"
 
 namespace stun {
@@ -43,9 +44,11 @@ class CSTUNResult : public ISTUNResult, public foundation::INetworkChangeSink {
     static constexpr int kPollMs = 1000;
 
     // servers: comma-separated names or dotted quads (null is logged and taken as empty). After
-    // every pass, message is posted to window with wParam and lParam 0.
+    // every pass, message is posted to window with wParam and lParam 0. The local addresses
+    // come from networkInfo, which outlives the service.
     CSTUNResult(const char* servers, platform::WindowHandle window, platform::UINT message,
-                platform::WPARAM wParam);
+                platform::WPARAM wParam,
+                platform::NetworkInfo& networkInfo = platform::SystemNetworkInfo());
     ~CSTUNResult() override;
     CSTUNResult(const CSTUNResult&) = delete;
     CSTUNResult& operator=(const CSTUNResult&) = delete;

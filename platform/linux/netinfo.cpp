@@ -137,22 +137,11 @@ class LinuxNetworkInfo final : public NetworkInfo {
     }
 };
 
-std::atomic<NetworkInfo*> g_installed{nullptr};
-
 }  // namespace
 
 NetworkInfo& SystemNetworkInfo() {
     static LinuxNetworkInfo info;
     return info;
-}
-
-NetworkInfo& CurrentNetworkInfo() {
-    NetworkInfo* installed = g_installed.load();
-    return installed != nullptr ? *installed : SystemNetworkInfo();
-}
-
-void InstallNetworkInfo(NetworkInfo* info) {
-    g_installed.store(info);
 }
 
 }  // namespace platform

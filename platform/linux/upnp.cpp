@@ -75,22 +75,11 @@ class MiniupnpcGatewayProbe final : public UpnpGatewayProbe {
     }
 };
 
-std::atomic<UpnpGatewayProbe*> g_installed{nullptr};
-
 }  // namespace
 
 UpnpGatewayProbe& SystemUpnpGatewayProbe() {
     static MiniupnpcGatewayProbe probe;
     return probe;
-}
-
-UpnpGatewayProbe& CurrentUpnpGatewayProbe() {
-    UpnpGatewayProbe* installed = g_installed.load();
-    return installed != nullptr ? *installed : SystemUpnpGatewayProbe();
-}
-
-void InstallUpnpGatewayProbe(UpnpGatewayProbe* probe) {
-    g_installed.store(probe);
 }
 
 }  // namespace platform

@@ -42,41 +42,41 @@ TEST(GetIPByName, LocalhostResolves) {
 }
 
 TEST(CreateUdpSocket, RotatingPortsContinueTheSequenceAcrossCallers) {
-    foundation::rotating_port::SetNext(40000);
+    foundation::RotatingPort ports(40000);
     uint16_t first = 0;
-    platform::Socket a(CreateUdpSocket(kLoopback, &first));
+    platform::Socket a(CreateUdpSocket(kLoopback, &first, ports));
     ASSERT_TRUE(a.IsValid());
     uint16_t second = 0;
-    platform::Socket b(CreateUdpSocket(kLoopback, &second));
+    platform::Socket b(CreateUdpSocket(kLoopback, &second, ports));
     ASSERT_TRUE(b.IsValid());
     EXPECT_GE(first, 40000);
     EXPECT_GT(second, first);
     EXPECT_EQ(PortOf(a), first);
     EXPECT_EQ(PortOf(b), second);
-    EXPECT_EQ(foundation::rotating_port::Next(), second + 1);
-    // An absent port still advances the shared sequence without reporting it.
-    platform::Socket c(CreateUdpSocket(kLoopback, nullptr));
+    EXPECT_EQ(ports.Next(), second + 1);
+    // An absent port still advances the sequence without reporting it.
+    platform::Socket c(CreateUdpSocket(kLoopback, nullptr, ports));
     ASSERT_TRUE(c.IsValid());
     EXPECT_GT(PortOf(c), second);
 }
 
 TEST(CreateUdpSocket, WrapsFrom60000To10000) {
-    foundation::rotating_port::SetNext(60000);
+    foundation::RotatingPort ports(60000);
     platform::Socket probe(platform::OpenUdpSocket());
     if (!platform::BindSocket(probe.Get(), kLoopback, 60000)) {
         GTEST_SKIP() << "port 60000 is in use on this machine";
     }
     probe.Close();
     uint16_t port = 0;
-    platform::Socket s(CreateUdpSocket(kLoopback, &port));
+    platform::Socket s(CreateUdpSocket(kLoopback, &port, ports));
     EXPECT_EQ(port, 60000);
-    EXPECT_EQ(foundation::rotating_port::Next(), 10000);
+    EXPECT_EQ(ports.Next(), 10000);
 }
 
 TEST(CreateUdpSocket, FirstUseSeedsACandidateInTheRange) {
-    foundation::rotating_port::SetNext(0);
+    foundation::RotatingPort ports;
     uint16_t port = 0;
-    platform::Socket s(CreateUdpSocket(kLoopback, &port));
+    platform::Socket s(CreateUdpSocket(kLoopback, &port, ports));
     ASSERT_TRUE(s.IsValid());
     EXPECT_GE(port, 10000);
     EXPECT_LE(port, 60000);
@@ -86,20 +86,20 @@ TEST(CreateUdpSocket, TakenExactPortFailsAtOnceAndLeavesTheSequenceAlone) {
     uint16_t taken = 0;
     platform::Socket holder(CreateUdpSocket(kLoopback, &taken));
     ASSERT_TRUE(holder.IsValid());
-    const uint16_t next = foundation::rotating_port::Next();
+    foundation::RotatingPort ports(40000);
     uint16_t again = taken;
-    EXPECT_FALSE(CreateUdpSocket(kLoopback, &again).IsValid());
+    EXPECT_FALSE(CreateUdpSocket(kLoopback, &again, ports).IsValid());
     EXPECT_EQ(again, taken);
-    EXPECT_EQ(foundation::rotating_port::Next(), next);
+    EXPECT_EQ(ports.Next(), 40000);
 }
 
 TEST(CreateUdpSocket, TakenRotatingCandidateIsSkipped) {
     uint16_t taken = 0;
     platform::Socket holder(CreateUdpSocket(kLoopback, &taken));
     ASSERT_TRUE(holder.IsValid());
-    foundation::rotating_port::SetNext(taken);
+    foundation::RotatingPort ports(taken);
     uint16_t port = 0;
-    platform::Socket s(CreateUdpSocket(kLoopback, &port));
+    platform::Socket s(CreateUdpSocket(kLoopback, &port, ports));
     ASSERT_TRUE(s.IsValid());
     EXPECT_NE(port, taken);
 }
@@ -209,33 +209,34 @@ TEST_F(AdapterQueries, GatewayComesFromTheFirstAdapterWhosePrimaryAddressMatches
                      {2, "eth0", {"10.0.0.2", "10.0.0.3"}, "10.0.0.1"},
                      {3, "eth1", {"10.0.0.3"}, "10.0.0.254"},
                      {4, "eth2", {"192.0.2.5"}, ""}};
-    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.2"), "10.0.0.1");
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.2", fake), "10.0.0.1");
     // A secondary address does not count; the adapter where it is primary does.
-    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.3"), "10.0.0.254");
-    EXPECT_EQ(foundation::GetGatewayForLocalAddress("192.0.2.5"), "");
-    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.02"), "");  // byte-wise comparison
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.3", fake), "10.0.0.254");
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("192.0.2.5", fake), "");
+    // Compared byte by byte.
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.02", fake), "");
     fake.ok = false;
-    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.2"), "");
+    EXPECT_EQ(foundation::GetGatewayForLocalAddress("10.0.0.2", fake), "");
 }
 
 TEST_F(AdapterQueries, InterfaceAddressAndGatewayNeedBothIndexAndGateway) {
     fake.adapters = {{4, "eth2", {"192.0.2.5"}, ""}, {7, "eth0", {"10.0.0.2"}, "10.0.0.1"}};
     std::string address = "x";
     std::string gateway = "y";
-    EXPECT_FALSE(foundation::GetInterfaceAddressAndGateway(4, address, gateway));
+    EXPECT_FALSE(foundation::GetInterfaceAddressAndGateway(4, address, gateway, fake));
     EXPECT_EQ(address, "x");
-    ASSERT_TRUE(foundation::GetInterfaceAddressAndGateway(7, address, gateway));
+    ASSERT_TRUE(foundation::GetInterfaceAddressAndGateway(7, address, gateway, fake));
     EXPECT_EQ(address, "10.0.0.2");
     EXPECT_EQ(gateway, "10.0.0.1");
 }
 
 TEST_F(AdapterQueries, UdpCounterErrorBecomesAWin32Result) {
     uint32_t count = 0;
-    EXPECT_EQ(foundation::QueryUdpInDatagrams(&count), 0);
+    EXPECT_EQ(foundation::QueryUdpInDatagrams(&count, fake), 0);
     EXPECT_EQ(count, 42u);
     fake.udpError = 0x12345;
     count = 7;
-    EXPECT_EQ(static_cast<uint32_t>(foundation::QueryUdpInDatagrams(&count)), 0x80072345u);
+    EXPECT_EQ(static_cast<uint32_t>(foundation::QueryUdpInDatagrams(&count, fake)), 0x80072345u);
     EXPECT_EQ(count, 7u);
 }
 

@@ -37,9 +37,6 @@ constexpr uint32_t Ip(uint32_t a, uint32_t b, uint32_t c, uint32_t d) {
 // Locked: the monitor's thread reads while the test changes it.
 class TestNetworkInfo : public platform::NetworkInfo {
   public:
-    TestNetworkInfo() { platform::InstallNetworkInfo(this); }
-    ~TestNetworkInfo() override { platform::InstallNetworkInfo(nullptr); }
-
     void Set(std::vector<platform::AdapterInfo> adapters, Addresses table, bool tableOk = true,
              bool adaptersOk = true) {
         std::lock_guard<std::mutex> lock(mutex_);
@@ -107,7 +104,7 @@ TEST(NetworkChangeMonitor, ListsTheFirstAddressOfEachInterfaceWithAGatewayInTabl
               {7, "bcast", {"255.255.255.255"}, "10.0.0.1"}},
              {Ip(172, 16, 0, 9), 0, Ip(127, 0, 0, 1), Ip(10, 0, 0, 5), Ip(10, 0, 0, 6),
               Ip(192, 168, 1, 7), 0xFFFFFFFF, Ip(127, 0, 0, 5)});
-    CNetworkChangeMonitor monitor;
+    CNetworkChangeMonitor monitor(info);
     EXPECT_TRUE(monitor.GetLocalIPs().empty());
     monitor.RefreshLocalIPs();
     EXPECT_EQ(monitor.GetLocalIPs(),
@@ -129,7 +126,7 @@ TEST(NetworkChangeMonitor, StartRebuildsOnceOnTheCallerAndStopThenStartRebuildsA
     info.SetSingleHost(Ip(10, 0, 0, 5));
     const int descriptors = platform::CountOpenDescriptors();
     {
-        CNetworkChangeMonitor monitor;
+        CNetworkChangeMonitor monitor(info);
         monitor.Stop();  // idle: nothing to end
         ASSERT_TRUE(monitor.Start());
         EXPECT_EQ(monitor.GetLocalIPs(), Addresses{Ip(10, 0, 0, 5)});
@@ -224,7 +221,7 @@ class LabNetworkChangeMonitor : public ::testing::Test {
         ns_.emplace("nqmon");
         ASSERT_TRUE(ns_->IsValid() && IpCommand("link add v0 type veth peer name v1") &&
                     IpCommand("link set v0 up") && IpCommand("link set v1 up") && ns_->Enter());
-        monitor_.emplace();
+        monitor_.emplace(info_);
     }
     bool IpCommand(const std::string& command) { return ns_->Ip(command); }
     // On-link, so it may exist before any address; makes the addresses of v0 count.

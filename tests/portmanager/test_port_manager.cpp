@@ -25,23 +25,16 @@ constexpr uint32_t B = 0xC000020B;  // 192.0.2.11
 constexpr uint32_t P = 0xC6336407;  // 198.51.100.7
 constexpr uint32_t Q = 0xCB007109;  // 203.0.113.9
 
-class FixedUpnpProbe : public platform::UpnpGatewayProbe {
-  public:
-    explicit FixedUpnpProbe(bool present) : present_(present) {
-        platform::InstallUpnpGatewayProbe(this);
-    }
-    ~FixedUpnpProbe() override { platform::InstallUpnpGatewayProbe(nullptr); }
-    bool GatewayPresent() override { return present_; }
-
-  private:
-    bool present_;
+struct FixedUpnpProbe : platform::UpnpGatewayProbe {
+    bool GatewayPresent() override { return present; }
+    bool present = false;  // set before the port manager starts a search
 };
 
 // Each test: a port manager with a fake STUN service, a fake network listing 192.0.2.10, and no
 // real UPnP search.
 class PortManager : public ::testing::Test {
   protected:
-    PortManager() : upnp(false) { net.AddInterface("192.0.2.10", "192.0.2.1"); }
+    PortManager() { net.AddInterface("192.0.2.10", "192.0.2.1"); }
 
     void PumpUntilEvents(RecordingSink& sink, size_t count) {
         ASSERT_TRUE(
@@ -82,12 +75,14 @@ class PortManager : public ::testing::Test {
     RecordingSink& NewSink() { return sinks.emplace_back(); }
     // A fresh port manager (the previous one is released).
     PortManagerWithFakeStun& H() { return *holder; }
-    void Renew() { holder = std::make_unique<PortManagerWithFakeStun>(); }
+    void Renew() { holder = std::make_unique<PortManagerWithFakeStun>(Services()); }
+    portmanager::PortManagerServices Services() { return testsupport::ServicesWith(net, &upnp); }
 
     testsupport::FakeNetworkInfo net;
     FixedUpnpProbe upnp;
     std::deque<RecordingSink> sinks;
-    std::unique_ptr<PortManagerWithFakeStun> holder = std::make_unique<PortManagerWithFakeStun>();
+    std::unique_ptr<PortManagerWithFakeStun> holder =
+        std::make_unique<PortManagerWithFakeStun>(Services());
 };
 
 HRESULT Init(IAdvancedPortManager* pm, BSTR stun, LONG start, LONG count, BSTR sip, BSTR media,
@@ -159,7 +154,7 @@ TEST_F(PortManager, InitializeChecksRunInOrderAndChangeNothingOnFailure) {
 
 TEST_F(PortManager, CountOfZeroOrBelowAndAnEmptyServerAreAccepted) {
     for (LONG count : {0, -5}) {
-        PortManagerWithFakeStun other;
+        PortManagerWithFakeStun other(Services());
         BStr empty("");
         BStr sip("sip");
         BStr media("media");
@@ -420,7 +415,7 @@ TEST_F(PortManager, RefreshAfterShutdownFallsBackInsteadOfUsingTheGoneService) {
 }
 
 TEST_F(PortManager, UpnpGatewayRecommendsTheSipProxy) {
-    FixedUpnpProbe gateway(true);
+    upnp.present = true;
     RecordingSink& sink = NewSink();
     H().Connect(sink);
     ASSERT_EQ(H().Initialize(true, true), S_OK);

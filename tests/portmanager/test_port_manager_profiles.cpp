@@ -117,7 +117,7 @@ class Profiles : public ::testing::Test {
     testsupport::FakeNetworkInfo net;
     std::deque<RecordingSink> sinks;
     LoopbackSocket sipServerSocket;
-    PortManagerWithFakeStun h;
+    PortManagerWithFakeStun h{testsupport::ServicesWith(net)};
     IPortMappingProvider* provider = nullptr;
     LONG minPort = 0;
     LONG maxPort = 0;
@@ -344,14 +344,14 @@ TEST(ProfilesLifetime, EveryDescriptorIsClosedAtFinalRelease) {
     net.AddInterface("127.0.0.1", "");
     {
         // The thread's message queue is made once and kept; make it before counting.
-        PortManagerWithFakeStun warmUp;
+        PortManagerWithFakeStun warmUp(testsupport::ServicesWith(net));
     }
     const int before = platform::CountOpenDescriptors();
     const auto base = FindFreeWindow(24);
     ASSERT_TRUE(base.has_value());
     {
         std::deque<RecordingSink> sinks;
-        PortManagerWithFakeStun h;
+        PortManagerWithFakeStun h(testsupport::ServicesWith(net));
         h.nextList.count = 1;
         h.nextList.entries[0] = {kLoopbackHost, stun::STUN_RESULT_OPEN, kLoopbackHost};
         RecordingSink& sink = sinks.emplace_back();

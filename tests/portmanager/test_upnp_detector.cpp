@@ -99,12 +99,10 @@ class FakeProbe : public platform::UpnpGatewayProbe {
 
 class UpnpDetectorTest : public ::testing::Test {
   protected:
-    UpnpDetectorTest() { platform::InstallUpnpGatewayProbe(&probe_); }
-    ~UpnpDetectorTest() override { platform::InstallUpnpGatewayProbe(nullptr); }
     void SetUp() override { ASSERT_TRUE(window_.CreateMessageWindow()); }
 
     void NewDetector() {
-        detector_ = std::make_unique<UpnpDetector>();
+        detector_ = std::make_unique<UpnpDetector>(probe_);
         window_.detector = detector_.get();
     }
     // Starts a detection and returns once the probe has been entered.

@@ -101,7 +101,7 @@ TEST_F(STUNResultWithStund, ReadyOnceARefreshCompletedAPassOfTheFirstTenAddresse
     LocalAddresses local(addresses);
     Window window;
     CSTUNResult service(foundation::FormatHostAddress(stund_.PrimaryAddress()).c_str(),
-                        window.Handle(), kMessage, kWParam);
+                        window.Handle(), kMessage, kWParam, local);
     EXPECT_FALSE(service.IsRunning());
     ASSERT_EQ(service.Start(), S_OK);
     EXPECT_TRUE(service.IsRunning());
@@ -143,7 +143,7 @@ TEST(STUNResult, APassWithoutAServerOrWithoutAddressesStillStoresAndPosts) {
     for (const auto& c : cases) {
         LocalAddresses local(c.addresses);
         Window window;
-        CSTUNResult service(c.servers, window.Handle(), kMessage, kWParam);
+        CSTUNResult service(c.servers, window.Handle(), kMessage, kWParam, local);
         ASSERT_EQ(service.Refresh(), S_OK);
         ASSERT_TRUE(window.WaitFor(1));
         STUNResultList list;
@@ -159,7 +159,7 @@ TEST(STUNResult, APassWithoutAServerOrWithoutAddressesStillStoresAndPosts) {
 }
 
 TEST_F(STUNResultInATransaction, RefreshesDuringAPassGiveExactlyOneFurtherPass) {
-    CSTUNResult service(server_.c_str(), window_.Handle(), kMessage, kWParam);
+    CSTUNResult service(server_.c_str(), window_.Handle(), kMessage, kWParam, local_);
     ASSERT_EQ(service.Refresh(), S_OK);
     ASSERT_TRUE(fake_->WaitForRequests(1, 5000));  // the pass now waits for an answer
     ASSERT_EQ(service.Refresh(), S_OK);
@@ -176,7 +176,7 @@ TEST_F(STUNResultInATransaction, RefreshesDuringAPassGiveExactlyOneFurtherPass) 
 TEST_F(STUNResultInATransaction, StopEndsThePassAtOnceWithoutResultOrLeak) {
     const int descriptors = platform::CountOpenDescriptors();
     {
-        CSTUNResult service(server_.c_str(), window_.Handle(), kMessage, kWParam);
+        CSTUNResult service(server_.c_str(), window_.Handle(), kMessage, kWParam, local_);
         ASSERT_EQ(service.Refresh(), S_OK);
         ASSERT_TRUE(fake_->WaitForRequests(2, 5000));  // inside the retransmission schedule
         const auto stopping = Clock::now();
@@ -191,7 +191,7 @@ TEST_F(STUNResultInATransaction, StopEndsThePassAtOnceWithoutResultOrLeak) {
 }
 
 TEST_F(STUNResultInATransaction, GetSTUNResultWaitsOnlyForAPassThatWasAskedFor) {
-    CSTUNResult service(server_.c_str(), nullptr, kMessage, kWParam);
+    CSTUNResult service(server_.c_str(), nullptr, kMessage, kWParam, local_);
     STUNResultList untouched;
     untouched.count = 77;
     EXPECT_FALSE(service.GetSTUNResult(nullptr));

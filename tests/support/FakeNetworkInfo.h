@@ -1,4 +1,4 @@
-// Interfaces, addresses and gateways as a test describes them, installed for the test's life.
+// Interfaces, addresses and gateways as a test describes them, for the objects it is given to.
 #pragma once
 
 #include <string>
@@ -10,8 +10,7 @@ namespace testsupport {
 
 class FakeNetworkInfo : public platform::NetworkInfo {
   public:
-    FakeNetworkInfo() { platform::InstallNetworkInfo(this); }
-    ~FakeNetworkInfo() override { platform::InstallNetworkInfo(nullptr); }
+    FakeNetworkInfo() = default;
     FakeNetworkInfo(const FakeNetworkInfo&) = delete;
     FakeNetworkInfo& operator=(const FakeNetworkInfo&) = delete;
 

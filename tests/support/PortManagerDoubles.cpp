@@ -64,10 +64,20 @@ bool FakeStunService::GetSTUNResult(stun::STUNResultList* result) {
     return true;
 }
 
-PortManagerWithFakeStun::PortManagerWithFakeStun() {
+portmanager::PortManagerServices ServicesWith(platform::NetworkInfo& net,
+                                              platform::UpnpGatewayProbe* upnp) {
     portmanager::PortManagerServices services;
+    services.networkInfo = &net;
+    if (upnp != nullptr) {
+        services.upnpProbe = upnp;
+    }
+    return services;
+}
+
+PortManagerWithFakeStun::PortManagerWithFakeStun(portmanager::PortManagerServices services) {
     services.createStunService = [this](const char*, platform::WindowHandle window,
-                                        platform::UINT message, platform::WPARAM wParam) {
+                                        platform::UINT message, platform::WPARAM wParam,
+                                        platform::NetworkInfo&) {
         auto service = std::make_unique<FakeStunService>(window, message, wParam);
         service->list = nextList;
         service->ready = nextReady;

@@ -67,9 +67,10 @@ class FakeStunService final : public stun::ISTUNResult {
     platform::WPARAM m_wParam;
 };
 
-// A port manager whose STUN service is a FakeStunService (null until InitializeEx2).
+// A port manager whose STUN service is a FakeStunService (null until InitializeEx2); its other
+// services are those given.
 struct PortManagerWithFakeStun {
-    PortManagerWithFakeStun();
+    explicit PortManagerWithFakeStun(portmanager::PortManagerServices services = {});
     ~PortManagerWithFakeStun();
     PortManagerWithFakeStun(const PortManagerWithFakeStun&) = delete;
     PortManagerWithFakeStun& operator=(const PortManagerWithFakeStun&) = delete;
@@ -84,6 +85,10 @@ struct PortManagerWithFakeStun {
     stun::STUNResultList nextList;    // handed to the service when it is created
     bool nextReady = true;
 };
+
+// The system's services but for the network information (and the UPnP probe, unless null).
+portmanager::PortManagerServices ServicesWith(platform::NetworkInfo& net,
+                                              platform::UpnpGatewayProbe* upnp = nullptr);
 
 std::string ToUtf8(BSTR text);  // frees text
 

@@ -4,6 +4,7 @@
 #include <cstring>
 
 #include "foundation/Logger.h"
+#include "platform/random.h"
 
 namespace stun {
 
@@ -78,8 +79,12 @@ void CSTUNMessage::ClearFields() {
 
 void CSTUNMessage::Reset() {
     ClearFields();
-    for (uint8_t& b : m_transactionId) {
-        b = static_cast<uint8_t>(std::rand() & 0xFF);
+    // An id an off-path host can guess lets it forge the answer that sets our public address.
+    if (!platform::RandomBytes(m_transactionId, sizeof m_transactionId)) {
+        // Only a system without a generator gets here: a guessable id still beats none.
+        for (uint8_t& b : m_transactionId) {
+            b = static_cast<uint8_t>(std::rand() & 0xFF);
+        }
     }
 }
 

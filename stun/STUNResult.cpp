@@ -1,6 +1,5 @@
 #include "stun/STUNResult.h"
 
-#include <cerrno>
 #include <vector>
 
 #include "foundation/Logger.h"
@@ -41,11 +40,11 @@ HRESULT CSTUNResult::Start() {
     if (IsRunningLocked()) {
         return S_OK;
     }
-    errno = 0;
     auto event = std::make_unique<platform::Event>();
     if (!event->IsValid()) {
-        // The system's own code, as the caller expects, not a COM result.
-        return errno != 0 ? static_cast<HRESULT>(errno) : E_FAIL;
+        // A bare positive code would pass every SUCCEEDED check up to the port manager.
+        return event->Error() > 0 ? HRESULT_FROM_WIN32(static_cast<uint32_t>(event->Error()))
+                                  : E_FAIL;
     }
     m_refreshEvent = std::move(event);
     m_monitor.Subscribe(this);

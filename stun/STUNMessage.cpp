@@ -10,6 +10,8 @@ namespace stun {
 
 namespace {
 
+// Decode logs the address lines for RecvFrom and for the transactions, which receive without
+// it, under the one name those lines have always carried.
 constexpr const char* kRecvFromName = "CSTUNMessage::RecvFrom";
 
 uint16_t Read16(const uint8_t* p) {

@@ -76,6 +76,8 @@ class Event {
     Event& operator=(const Event&) = delete;
 
     bool IsValid() const { return fd_ >= 0; }
+    // The system's error code when the event could not be created, else 0.
+    int Error() const { return error_; }
     void Set();
     void Reset();
     // An auto-reset event is consumed by the waiter that sees it.
@@ -83,6 +85,7 @@ class Event {
 
   private:
     int fd_;
+    int error_;
     bool manualReset_;
 };
 

@@ -11,7 +11,8 @@ namespace {
 constexpr const char* kGetResult = "STUN_GetResult";
 constexpr const char* kTestServers = "STUN_TestServers";
 
-void LogError(const char* message) {
+// STUN_GetResult's error lines.
+void LogGetResultError(const char* message) {
     NQ_LOG(kGetResult, foundation::kLogError, "%s", message);
 }
 
@@ -40,7 +41,7 @@ void STUN_GetResult(uint32_t serverAddress, uint16_t serverPort, STUNResultEntry
         return;
     }
     if (!test1.HasMandatoryAttributes()) {
-        LogError("response on test 1 doesn't have the mandatory attributes");
+        LogGetResultError("response on test 1 doesn't have the mandatory attributes");
         entry.stunResult = STUN_RESULT_UNKNOWN;
         return;
     }
@@ -60,7 +61,7 @@ void STUN_GetResult(uint32_t serverAddress, uint16_t serverPort, STUNResultEntry
             return;
         }
         if (!test2.HasMandatoryAttributes()) {
-            LogError(
+            LogGetResultError(
                 "response on test 2 (the case with static public IP) doesn't have the mandatory "
                 "attributes!!!");
             entry.stunResult = STUN_RESULT_UNKNOWN;
@@ -75,7 +76,7 @@ void STUN_GetResult(uint32_t serverAddress, uint16_t serverPort, STUNResultEntry
 
     if (RunTest(local, serverAddress, serverPort, true, true, test2)) {
         if (!test2.HasMandatoryAttributes()) {
-            LogError(
+            LogGetResultError(
                 "response on test 2 (the case without static public IP) doesn't have the "
                 "mandatory attributes");
             entry.stunResult = STUN_RESULT_UNKNOWN;
@@ -93,7 +94,7 @@ void STUN_GetResult(uint32_t serverAddress, uint16_t serverPort, STUNResultEntry
         return;
     }
     if (!test11.HasMandatoryAttributes()) {
-        LogError("response on test 1_1 doesn't have the mandatory attributes");
+        LogGetResultError("response on test 1_1 doesn't have the mandatory attributes");
         entry.stunResult = STUN_RESULT_UNKNOWN;
         return;
     }
@@ -114,14 +115,13 @@ bool ResolveSTUNServer(const char* name, bool logErrors, uint32_t& hostAddress) 
     if (name == nullptr) {
         return false;
     }
-    uint32_t net = platform::InetAddrNet(name);
-    if (net == platform::kInaddrNone) {
-        const int error = platform::ResolveHostNameNet(name, &net);
-        if (error != 0) {
-            if (logErrors && error != platform::kErrHostNotFound) {
-                NQ_LOG("GetIPByName", foundation::kLogError, "%s",
-                       "Failed Assertion - dwError == WSAHOST_NOT_FOUND");
-            }
+    uint32_t net = 0;
+    if (logErrors) {
+        // Logs a resolver failure other than an unknown name under its own name.
+        net = foundation::GetIPByName(name);
+    } else {
+        net = platform::InetAddrNet(name);
+        if (net == platform::kInaddrNone && platform::ResolveHostNameNet(name, &net) != 0) {
             return false;
         }
     }

@@ -4,11 +4,14 @@
 #include <cstring>
 
 #include "foundation/Logger.h"
+#include "platform/random.h"
 
 namespace stun {
 
 namespace {
 
+// Decode logs the address lines for RecvFrom and for the transactions, which receive without
+// it, under the one name those lines have always carried.
 constexpr const char* kRecvFromName = "CSTUNMessage::RecvFrom";
 
 uint16_t Read16(const uint8_t* p) {
@@ -78,8 +81,12 @@ void CSTUNMessage::ClearFields() {
 
 void CSTUNMessage::Reset() {
     ClearFields();
-    for (uint8_t& b : m_transactionId) {
-        b = static_cast<uint8_t>(std::rand() & 0xFF);
+    // An id an off-path host can guess lets it forge the answer that sets our public address.
+    if (!platform::RandomBytes(m_transactionId, sizeof m_transactionId)) {
+        // Only a system without a generator gets here: a guessable id still beats none.
+        for (uint8_t& b : m_transactionId) {
+            b = static_cast<uint8_t>(std::rand() & 0xFF);
+        }
     }
 }
 

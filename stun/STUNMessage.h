@@ -58,7 +58,8 @@ class CSTUNMessage {
     CSTUNMessage();
     explicit CSTUNMessage(uint16_t messageType);
 
-    // Clears type, length and all slots and draws a new transaction id: 16 low bytes of rand().
+    // Clears type, length and all slots and draws a new transaction id from the system's
+    // cryptographic generator.
     void Reset();
 
     // Writes the request datagram into out: header (type, the stored length, id), then

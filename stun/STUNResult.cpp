@@ -1,6 +1,5 @@
 #include "stun/STUNResult.h"
 
-#include <cerrno>
 #include <vector>
 
 #include "foundation/Logger.h"
@@ -10,6 +9,8 @@ namespace stun {
 
 namespace {
 constexpr const char* kEntered = "Entered...";
+constexpr const char* kConstructor = "CSTUNResult::CSTUNResult";
+constexpr const char* kThread = "CSTUNResult::STUNResultThread";
 constexpr const char* kProcess = "CSTUNResult::ProcessSTUNResultThread";
 constexpr const char* kGetResult = "CSTUNResult::GetSTUNResult";
 constexpr uint32_t kWaitFailed = 0xFFFFFFFFu;  // WAIT_FAILED
@@ -18,9 +19,9 @@ constexpr uint32_t kWaitFailed = 0xFFFFFFFFu;  // WAIT_FAILED
 CSTUNResult::CSTUNResult(const char* servers, platform::WindowHandle window, platform::UINT message,
                          platform::WPARAM wParam, platform::NetworkInfo& networkInfo)
     : m_monitor(networkInfo), m_window(window), m_message(message), m_wParam(wParam) {
-    NQ_TRACE_ENTERED("CSTUNResult::CSTUNResult");
+    NQ_TRACE_ENTERED(kConstructor);
     if (servers == nullptr) {
-        NQ_LOG("CSTUNResult::CSTUNResult", foundation::kLogError,
+        NQ_LOG(kConstructor, foundation::kLogError,
                "Failed Assertion (line %d) - szSTUNServer != NULL", 19);
     } else {
         m_servers.assign(servers);
@@ -41,11 +42,11 @@ HRESULT CSTUNResult::Start() {
     if (IsRunningLocked()) {
         return S_OK;
     }
-    errno = 0;
     auto event = std::make_unique<platform::Event>();
     if (!event->IsValid()) {
-        // The system's own code, as the caller expects, not a COM result.
-        return errno != 0 ? static_cast<HRESULT>(errno) : E_FAIL;
+        // A bare positive code would pass every SUCCEEDED check up to the port manager.
+        return event->Error() > 0 ? HRESULT_FROM_WIN32(static_cast<uint32_t>(event->Error()))
+                                  : E_FAIL;
     }
     m_refreshEvent = std::move(event);
     m_monitor.Subscribe(this);
@@ -159,10 +160,9 @@ void CSTUNResult::OnRouteChanged() {
 }
 
 void CSTUNResult::STUNResultThread(CSTUNResult* self) {
-    NQ_TRACE_ENTERED("CSTUNResult::STUNResultThread");
+    NQ_TRACE_ENTERED(kThread);
     if (self == nullptr) {
-        NQ_LOG("CSTUNResult::STUNResultThread", foundation::kLogError, "%s",
-               "Failed Assertion - NULL != pSTUNResult");
+        NQ_LOG(kThread, foundation::kLogError, "%s", "Failed Assertion - NULL != pSTUNResult");
         return;
     }
     self->ProcessSTUNResultThread();
@@ -213,7 +213,7 @@ bool CSTUNResult::ClassifyLocalAddresses(STUNResultList& list) {
     const std::vector<uint32_t> addresses = m_monitor.GetLocalIPs();
     size_t count = addresses.size();
     if (count > kMaxSTUNResults) {
-        NQ_LOG(kProcess, foundation::kLogWarn,
+        NQ_LOG("CSTUNResult::ClassifyLocalAddresses", foundation::kLogWarn,
                "%zu local addresses; classifying the first %zu and skipping %zu", count,
                kMaxSTUNResults, count - kMaxSTUNResults);
         count = kMaxSTUNResults;

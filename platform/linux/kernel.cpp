@@ -142,7 +142,9 @@ WaitResult Sleep(int milliseconds) {
 }
 
 Event::Event(bool manualReset, bool initialState)
-    : fd_(eventfd(initialState ? 1 : 0, EFD_CLOEXEC | EFD_NONBLOCK)), manualReset_(manualReset) {}
+    : fd_(eventfd(initialState ? 1 : 0, EFD_CLOEXEC | EFD_NONBLOCK)),
+      error_(fd_ < 0 ? errno : 0),
+      manualReset_(manualReset) {}
 
 Event::~Event() {
     if (fd_ >= 0) {

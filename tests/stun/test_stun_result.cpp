@@ -2,9 +2,13 @@
 // addresses exist (127.0.0.1 never counts, so the tests use 127.0.0.5 and up with a made-up
 // gateway); the real stund classifies them, and a fake that stays silent holds a pass inside a
 // STUN transaction for as long as a test needs.
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
+#include <unistd.h>
 
 #include <atomic>
+#include <cerrno>
 #include <chrono>
 #include <cstdint>
 #include <memory>
@@ -131,6 +135,27 @@ TEST_F(STUNResultWithStund, ReadyOnceARefreshCompletedAPassOfTheFirstTenAddresse
     EXPECT_TRUE(service.IsRunning());
     ASSERT_TRUE(window.WaitFor(2)) << "no pass after the restart";
     EXPECT_TRUE(service.IsSTUNResultReady());
+}
+
+// With no descriptor left the refresh event cannot be made. The bare system code would pass
+// every SUCCEEDED check and leave a discovery waiting for ever.
+TEST(STUNResult, StartFailsWhenItsEventCannotBeCreated) {
+    CSTUNResult service("127.0.0.1", nullptr, kMessage, kWParam);
+    rlimit saved{};
+    ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &saved), 0);
+    rlimit low = saved;
+    low.rlim_cur = static_cast<rlim_t>(platform::CountOpenDescriptors());
+    ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &low), 0);
+    std::vector<int> fillers;  // a hole below the limit would still give an event
+    for (int fd = 0; (fd = open("/dev/null", O_RDONLY | O_CLOEXEC)) >= 0;) {
+        fillers.push_back(fd);
+    }
+    const HRESULT hr = service.Start();
+    for (int fd : fillers) {
+        close(fd);
+    }
+    ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &saved), 0);
+    EXPECT_TRUE(FAILED(hr) && hr == HRESULT_FROM_WIN32(EMFILE)) << std::hex << hr;
 }
 
 TEST(STUNResult, APassWithoutAServerOrWithoutAddressesStillStoresAndPosts) {

@@ -1,6 +1,5 @@
 #include "tests/support/FakeStunServer.h"
 
-#include <algorithm>
 #include <chrono>
 #include <utility>
 
@@ -45,8 +44,6 @@ FakeStunServer::FakeStunServer(uint32_t address, uint16_t port) : address_(addre
         socket_.Close();
         return;
     }
-    answerAddress_ = address_;
-    answerPort_ = port_;
     running_ = thread_.Start([this] { Run(); });
 }
 
@@ -60,71 +57,20 @@ void FakeStunServer::SetMode(Mode mode) {
     mode_ = mode;
 }
 
-void FakeStunServer::SetRawAnswer(std::vector<uint8_t> bytes, bool copyTransactionId) {
-    std::lock_guard<std::mutex> lock(mutex_);
-    raw_ = std::move(bytes);
-    copyTransactionId_ = copyTransactionId;
-    mode_ = Mode::kRaw;
-}
-
 void FakeStunServer::SetMappedPort(std::optional<uint16_t> port) {
     std::lock_guard<std::mutex> lock(mutex_);
     mappedPort_ = port;
 }
 
-void FakeStunServer::SetSourceAddress(uint32_t address, uint16_t port) {
-    std::lock_guard<std::mutex> lock(mutex_);
-    source_ = std::make_pair(address, port);
-}
-
-void FakeStunServer::SetChangedAddress(uint32_t address, uint16_t port) {
-    std::lock_guard<std::mutex> lock(mutex_);
-    changed_ = std::make_pair(address, port);
-}
-
-bool FakeStunServer::AnswerFrom(uint32_t address, uint16_t port) {
-    platform::Socket s = platform::OpenUdpSocket();
-    uint16_t bound = 0;
-    if (!s || !platform::BindSocket(s.Get(), address, port) ||
-        !platform::GetSocketName(s.Get(), nullptr, &bound)) {
-        return false;
-    }
-    std::lock_guard<std::mutex> lock(mutex_);
-    answerSocket_ = std::move(s);
-    answerAddress_ = address;
-    answerPort_ = bound;
-    return true;
-}
-
-uint32_t FakeStunServer::AnswerAddress() const {
-    std::lock_guard<std::mutex> lock(mutex_);
-    return answerAddress_;
-}
-
-uint16_t FakeStunServer::AnswerPort() const {
-    std::lock_guard<std::mutex> lock(mutex_);
-    return answerPort_;
-}
-
 int FakeStunServer::RequestCount() const {
     std::lock_guard<std::mutex> lock(mutex_);
-    return static_cast<int>(requests_.size());
+    return requests_;
 }
 
 bool FakeStunServer::WaitForRequests(int count, int timeoutMs) const {
     std::unique_lock<std::mutex> lock(mutex_);
     return arrived_.wait_for(lock, std::chrono::milliseconds(timeoutMs),
-                             [&] { return static_cast<int>(requests_.size()) >= count; });
-}
-
-std::vector<FakeStunServer::Request> FakeStunServer::Requests() const {
-    std::lock_guard<std::mutex> lock(mutex_);
-    return requests_;
-}
-
-FakeStunServer::Request FakeStunServer::LastRequest() const {
-    std::lock_guard<std::mutex> lock(mutex_);
-    return requests_.empty() ? Request{} : requests_.back();
+                             [&] { return requests_ >= count; });
 }
 
 void FakeStunServer::Run() {
@@ -135,76 +81,48 @@ void FakeStunServer::Run() {
         if (ready != 1) {
             continue;
         }
-        Request request;
-        const int n = platform::ReceiveFrom(socket_.Get(), buffer, sizeof buffer,
-                                            &request.fromAddress, &request.fromPort);
+        uint32_t fromAddress = 0;
+        uint16_t fromPort = 0;
+        const int n =
+            platform::ReceiveFrom(socket_.Get(), buffer, sizeof buffer, &fromAddress, &fromPort);
         if (n < 0) {
             continue;
         }
-        request.bytes.assign(buffer, buffer + n);
-        request.tickMs = platform::GetTickCount64();
         {
             std::lock_guard<std::mutex> lock(mutex_);
-            requests_.push_back(request);
+            ++requests_;
         }
         arrived_.notify_all();
-        Answer(request);
+        Answer(std::vector<uint8_t>(buffer, buffer + n), fromAddress, fromPort);
     }
 }
 
-void FakeStunServer::Answer(const Request& request) {
+void FakeStunServer::Answer(const std::vector<uint8_t>& request, uint32_t fromAddress,
+                            uint16_t fromPort) {
     std::lock_guard<std::mutex> lock(mutex_);
-    if (mode_ == Mode::kSilent || request.bytes.size() < kHeader) {
+    if (mode_ == Mode::kSilent || request.size() < kHeader) {
         return;
     }
-    const auto responseAddress = FindResponseAddress(request.bytes);
-    const uint32_t toAddress = responseAddress ? responseAddress->first : request.fromAddress;
-    const uint16_t toPort = responseAddress ? responseAddress->second : request.fromPort;
-    const platform::SocketHandle out = answerSocket_ ? answerSocket_.Get() : socket_.Get();
-
-    std::vector<uint8_t> answer;
-    if (mode_ == Mode::kRaw) {
-        answer = raw_;
-        if (copyTransactionId_ && answer.size() >= kHeader) {
-            std::copy(request.bytes.begin() + 4, request.bytes.begin() + 20, answer.begin() + 4);
-        }
-    } else {
-        uint8_t id[16];
-        std::copy(request.bytes.begin() + 4, request.bytes.begin() + 20, id);
-        if (mode_ == Mode::kWrongTransactionId) {
-            for (uint8_t& b : id) {
-                b = static_cast<uint8_t>(~b);
-            }
-        }
-        answer =
-            BuildResponse(request, id, answerAddress_, answerPort_, responseAddress.has_value());
-    }
-    platform::SendTo(out, answer.data(), answer.size(), toAddress, toPort);
-}
-
-std::vector<uint8_t> FakeStunServer::BuildResponse(const Request& request,
-                                                   const uint8_t* transactionId,
-                                                   uint32_t fromAddress, uint16_t fromPort,
-                                                   bool reflected) const {
+    const auto responseAddress = FindResponseAddress(request);
     std::vector<uint8_t> out;
     out.reserve(64);  // also keeps GCC 12 from a false overflow warning on the insert below
     Put16(out, kBindingResponse);
     Put16(out, 0);  // patched below
-    out.insert(out.end(), transactionId, transactionId + 16);
-    PutAddress(out, 0x0001, request.fromAddress, mappedPort_.value_or(request.fromPort));
-    const auto source = source_.value_or(std::make_pair(fromAddress, fromPort));
-    PutAddress(out, 0x0004, source.first, source.second);
+    out.insert(out.end(), request.begin() + 4, request.begin() + 20);
+    PutAddress(out, 0x0001, fromAddress, mappedPort_.value_or(fromPort));
+    PutAddress(out, 0x0004, address_, port_);
     if (mode_ != Mode::kNoChangedAddress) {
-        const auto changed = changed_.value_or(std::make_pair(address_, port_));
-        PutAddress(out, 0x0005, changed.first, changed.second);
+        PutAddress(out, 0x0005, address_, port_);
     }
-    if (reflected) {
-        PutAddress(out, 0x000B, request.fromAddress, request.fromPort);
+    if (responseAddress) {
+        PutAddress(out, 0x000B, fromAddress, fromPort);
     }
     const size_t length = out.size() - kHeader;
     out[2] = static_cast<uint8_t>(length >> 8);
     out[3] = static_cast<uint8_t>(length);
-    return out;
+    platform::SendTo(socket_.Get(), out.data(), out.size(),
+                     responseAddress ? responseAddress->first : fromAddress,
+                     responseAddress ? responseAddress->second : fromPort);
 }
 
 }  // namespace testsupport

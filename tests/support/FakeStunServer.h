@@ -1,7 +1,7 @@
-// A classic STUN responder for the answers no real server gives: silence, a wrong transaction id,
-// a missing CHANGED-ADDRESS, arbitrary bytes, a translated mapped port, or an answer to a
-// RESPONSE-ADDRESS sent from the very socket the request went to. It listens on one UDP socket
-// on its own thread and records every request it gets.
+// A classic STUN responder for the answers no real server gives: silence, a missing
+// CHANGED-ADDRESS, a translated mapped port, or an answer to a RESPONSE-ADDRESS sent from the very
+// socket the request went to. It listens on one UDP socket on its own thread and counts the
+// requests it gets.
 #pragma once
 
 #include <condition_variable>
@@ -20,18 +20,9 @@ inline constexpr uint32_t kLoopback = 0x7F000001;  // 127.0.0.1, host order
 class FakeStunServer {
   public:
     enum class Mode {
-        kAnswer,              // a Binding Response with MAPPED, SOURCE and CHANGED-ADDRESS
-        kSilent,              // count and record, never answer
-        kWrongTransactionId,  // a normal answer whose id differs from the request's
-        kNoChangedAddress,    // a normal answer without CHANGED-ADDRESS
-        kRaw,                 // the bytes given to SetRawAnswer
-    };
-
-    struct Request {
-        std::vector<uint8_t> bytes;
-        uint32_t fromAddress = 0;
-        uint16_t fromPort = 0;
-        uint64_t tickMs = 0;  // platform::GetTickCount64() at arrival
+        kAnswer,            // a Binding Response with MAPPED, SOURCE and CHANGED-ADDRESS
+        kSilent,            // count, never answer
+        kNoChangedAddress,  // a normal answer without CHANGED-ADDRESS
     };
 
     // Binds address:port (port 0: the system picks one) and starts answering in kAnswer mode.
@@ -46,33 +37,17 @@ class FakeStunServer {
     uint16_t Port() const { return port_; }
 
     void SetMode(Mode mode);
-    // Sent verbatim in kRaw mode; with copyTransactionId the request's id is written over bytes
-    // 4..19 first (when the answer is that long), so that the answer reaches the parser.
-    void SetRawAnswer(std::vector<uint8_t> bytes, bool copyTransactionId = true);
     // MAPPED-ADDRESS carries this port instead of the sender's (a port-translating NAT).
     void SetMappedPort(std::optional<uint16_t> port);
-    // Defaults: SOURCE-ADDRESS is the answering socket, CHANGED-ADDRESS the listening one.
-    void SetSourceAddress(uint32_t address, uint16_t port);
-    void SetChangedAddress(uint32_t address, uint16_t port);
-    // From now on answers leave from a second socket bound to address:port (port 0: any).
-    // Returns false when that bind fails. AnswerPort() tells the port it got.
-    bool AnswerFrom(uint32_t address, uint16_t port);
-    uint32_t AnswerAddress() const;
-    uint16_t AnswerPort() const;
 
     int RequestCount() const;
     // Waits until at least count requests have arrived; false on timeout.
     bool WaitForRequests(int count, int timeoutMs) const;
-    std::vector<Request> Requests() const;
-    // An empty request when none arrived yet.
-    Request LastRequest() const;
 
   private:
     void Run();
-    void Answer(const Request& request);
-    std::vector<uint8_t> BuildResponse(const Request& request, const uint8_t* transactionId,
-                                       uint32_t fromAddress, uint16_t fromPort,
-                                       bool reflected) const;
+    // SOURCE-ADDRESS and CHANGED-ADDRESS are both this socket.
+    void Answer(const std::vector<uint8_t>& request, uint32_t fromAddress, uint16_t fromPort);
 
     platform::Socket socket_;
     uint32_t address_ = 0;
@@ -82,15 +57,8 @@ class FakeStunServer {
     mutable std::mutex mutex_;
     mutable std::condition_variable arrived_;
     Mode mode_ = Mode::kAnswer;
-    std::vector<uint8_t> raw_;
-    bool copyTransactionId_ = true;
     std::optional<uint16_t> mappedPort_;
-    std::optional<std::pair<uint32_t, uint16_t>> source_;
-    std::optional<std::pair<uint32_t, uint16_t>> changed_;
-    platform::Socket answerSocket_;
-    uint32_t answerAddress_ = 0;
-    uint16_t answerPort_ = 0;
-    std::vector<Request> requests_;
+    int requests_ = 0;
 
     platform::Thread thread_;  // last: stopped and joined before the members above go
 };

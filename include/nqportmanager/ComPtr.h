@@ -12,10 +12,16 @@
 // NQ_DECLARE_COM_IID(IFoo, IID_IFoo);
 template <typename T>
 inline constexpr const IID* ComIidOf = nullptr;
+// Whether ComIidOf<T> is declared: comparing the address with null is no constant expression
+// under UBSan's null checks, so the declaration says so itself.
+template <typename T>
+inline constexpr bool ComIidDeclared = false;
 
-#define NQ_DECLARE_COM_IID(Interface, iid) \
-    template <>                            \
-    inline constexpr const IID* ComIidOf<Interface> = &(iid)
+#define NQ_DECLARE_COM_IID(Interface, iid)                    \
+    template <>                                               \
+    inline constexpr const IID* ComIidOf<Interface> = &(iid); \
+    template <>                                               \
+    inline constexpr bool ComIidDeclared<Interface> = true
 
 NQ_DECLARE_COM_IID(IUnknown, IID_IUnknown);
 NQ_DECLARE_COM_IID(IDispatch, IID_IDispatch);
@@ -87,7 +93,7 @@ class ComPtr {
     // QueryInterface for U; an empty result with the failure code when it is not offered.
     template <typename U>
     HRESULT As(ComPtr<U>* out) const noexcept {
-        static_assert(ComIidOf<U> != nullptr, "declare the IID with NQ_DECLARE_COM_IID");
+        static_assert(ComIidDeclared<U>, "declare the IID with NQ_DECLARE_COM_IID");
         return As(*ComIidOf<U>, out);
     }
     template <typename U>

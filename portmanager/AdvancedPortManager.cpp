@@ -75,16 +75,8 @@ void CAdvancedPortManager::FinalRelease() {
         platform::KillTimer(Handle(), m_refreshTimerId);
         m_refreshTimerId = 0;
     }
-    if (m_pStunResult) {
-        m_pStunResult.reset();
-    }
-    m_sparePool.CloseFree();
-    m_audioRtpPool.CloseFree();
-    m_audioRtcpPool.CloseFree();
-    m_videoRtpPool.CloseFree();
-    m_videoRtcpPool.CloseFree();
-    m_sipMappings.clear();
-    m_mediaMappings.clear();
+    m_pStunResult.reset();
+    m_profile.Close();
     m_workerWindow.store(nullptr);
     DestroyMessageWindow();
 }
@@ -107,15 +99,6 @@ void CAdvancedPortManager::ResetToDefaults() {
     m_refreshVideo = true;
     m_refreshSIP = true;
     m_refreshTimerId = 0;
-}
-
-void CAdvancedPortManager::ResetRecommendations() {
-    m_state = PMS_INITIALIZING;
-    m_topology = PMT_UNKNOWN;
-    m_recommendedUpnpEnabled = false;
-    m_recommendedSipServer.clear();
-    m_discoveryComplete = false;
-    m_stunAddressesInUse = false;
 }
 
 // IUnknown
@@ -200,11 +183,11 @@ HRESULT CAdvancedPortManager::GetConnectionPointContainer(IConnectionPointContai
 }
 
 HRESULT CAdvancedPortManager::Advise(IUnknown* pUnkSink, DWORD* pdwCookie) {
-    return m_sinks.Advise(pUnkSink, pdwCookie);
+    return m_events.Advise(pUnkSink, pdwCookie);
 }
 
 HRESULT CAdvancedPortManager::Unadvise(DWORD dwCookie) {
-    return m_sinks.Unadvise(dwCookie);
+    return m_events.Unadvise(dwCookie);
 }
 
 HRESULT CAdvancedPortManager::EnumConnections(IEnumConnections** ppEnum) {
@@ -291,33 +274,6 @@ HRESULT CAdvancedPortManager::InitiateShutdown() {
     NQ_TRACE_ENTERED("CAdvancedPortManager::InitiateShutdown");
     platform::SetTimer(Handle(), SHUTDOWN_TIMER_ID, kShutdownTimerPeriodMs);
     return S_OK;
-}
-
-HRESULT CAdvancedPortManager::Refresh() {
-    // Before InitializeEx2 there is nothing to discover with, and a discovery would move the
-    // state on so that the object could never be initialised.
-    if (m_state == PMS_UNINITIALIZED) {
-        return E_FAIL;
-    }
-    ResetRecommendations();
-    if (!m_forceUpnpDisabled) {
-        m_upnpDetector.Start(Handle(), WM_PM_UPNP_DETECTED, 0);
-    } else if (!m_forceStunDisabled) {
-        StartStunDiscovery();
-    } else {
-        RecommendMediaProxy();
-        NotifyChange(PME_UPDATED);
-    }
-    return S_OK;
-}
-
-void CAdvancedPortManager::StartStunDiscovery() {
-    if (m_pStunResult && SUCCEEDED(m_pStunResult->Refresh())) {
-        return;
-    }
-    // No service (after Shutdown) or one that cannot start: the discovery ends in the fall-back.
-    RecommendMediaProxy();
-    NotifyChange(PME_UPDATED);
 }
 
 // Simple properties

@@ -17,9 +17,9 @@
 #include "platform/netinfo.h"
 #include "platform/upnp.h"
 #include "portmanager/ConnectionPoint.h"
+#include "portmanager/DiscoveryDecision.h"
 #include "portmanager/Dispatch.h"
-#include "portmanager/PortMapping.h"
-#include "portmanager/PortMappingPool.h"
+#include "portmanager/ProfileMappings.h"
 #include "portmanager/UpnpDetector.h"
 #include "stun/STUNResult.h"
 
@@ -50,6 +50,10 @@ struct PortManagerServices {
     static PortManagerServices Default();
 };
 
+// The COM identity, its connection point and its hidden window. The discovery and its
+// recommendations live in PortManagerDiscovery.cpp (the decision itself in DiscoveryDecision),
+// the profile's mappings in PortManagerProfiles.cpp (held by ProfileMappings), the window's
+// messages and the events in PortManagerWindow.cpp.
 class CAdvancedPortManager final : public ISupportErrorInfo,
                                    public IConnectionPointContainer,
                                    public IConnectionPoint,
@@ -163,14 +167,17 @@ class CAdvancedPortManager final : public ISupportErrorInfo,
     void OnUpnpDetected();
     void OnStunRefresh();
     void NotifyChange(PM_EVENT type);
-    // Discovery outcomes
-    void RecommendMediaProxy();
-    void ApplyStunAddresses(const stun::STUNResultEntry& entry);
+    // Discovery
     void StartStunDiscovery();
+    // What the answer concludes, applied and told to the sinks (or the STUN pass started).
+    void Conclude(DiscoveryInput::Answer answer);
+    DiscoveryInput Facts(DiscoveryInput::Answer answer,
+                         const stun::STUNResultList* stunResults) const;
+    void Apply(DiscoveryOutcome outcome);
 
     std::atomic<ULONG> m_refs{0};
     PortManagerServices m_services;
-    EventSinks m_sinks;
+    ConnectionPoint<_IAdvancedPortManagerEvents> m_events{DIID__IAdvancedPortManagerEvents};
     // A copy of the window handle for the monitor's thread, cleared before the window goes.
     std::atomic<platform::WindowHandle> m_workerWindow{nullptr};
 
@@ -197,13 +204,7 @@ class CAdvancedPortManager final : public ISupportErrorInfo,
     bool m_refreshSIP = true;
     uintptr_t m_refreshTimerId = 0;
 
-    PortMappingPool m_sparePool;
-    PortMappingPool m_audioRtpPool;
-    PortMappingPool m_audioRtcpPool;
-    PortMappingPool m_videoRtpPool;
-    PortMappingPool m_videoRtcpPool;
-    std::vector<PortMapping> m_mediaMappings;
-    std::vector<PortMapping> m_sipMappings;
+    ProfileMappings m_profile;
 
     foundation::CNetworkChangeMonitor m_monitor;
 };

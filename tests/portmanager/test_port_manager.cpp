@@ -42,7 +42,7 @@ class PortManager : public ::testing::Test {
     }
     std::string Text(HRESULT (IAdvancedPortManager::*getter)(BSTR*)) {
         BSTR s = nullptr;
-        EXPECT_EQ((H().pm->*getter)(&s), S_OK);
+        EXPECT_EQ((H().pm.Get()->*getter)(&s), S_OK);
         return ToUtf8(s);
     }
     std::string Private() { return Text(&IAdvancedPortManager::get_PrivateIpAddress); }
@@ -66,7 +66,7 @@ class PortManager : public ::testing::Test {
         if (unk == nullptr) {
             return false;
         }
-        EXPECT_EQ(unk, static_cast<IUnknown*>(H().pm));
+        EXPECT_EQ(unk, static_cast<IUnknown*>(H().pm.Get()));
         unk->Release();
         return true;
     }
@@ -120,7 +120,7 @@ TEST_F(PortManager, InitializeChecksRunInOrderAndChangeNothingOnFailure) {
     BStr stun("stun.example.net");
     BStr sip("sip");
     BStr media("media");
-    IAdvancedPortManager* pm = H().pm;
+    IAdvancedPortManager* pm = H().pm.Get();
     // A null server name wins over bad ports.
     EXPECT_EQ(Init(pm, nullptr, 1, 5000, sip.Get(), media.Get()), E_POINTER);
     EXPECT_EQ(Init(pm, stun.Get(), 1023, 16, sip.Get(), media.Get()), E_INVALIDARG);
@@ -158,7 +158,7 @@ TEST_F(PortManager, CountOfZeroOrBelowAndAnEmptyServerAreAccepted) {
     BStr media("media");
     for (LONG count : {0, -5}) {
         PortManagerWithFakeStun other(Services());
-        EXPECT_EQ(Init(other.pm, empty.Get(), 1024, count, sip.Get(), media.Get()), S_OK);
+        EXPECT_EQ(Init(other.pm.Get(), empty.Get(), 1024, count, sip.Get(), media.Get()), S_OK);
     }
     // InitializeEx: the same with the default refresh policy.
     PortManagerWithFakeStun other(Services());
@@ -330,7 +330,7 @@ TEST_F(PortManager, EventsReachEverySinkInConnectionOrder) {
     EXPECT_EQ(order[0], &first);
     EXPECT_EQ(order[1], &second);
     // The event names the very object the sinks are connected to.
-    EXPECT_EQ(first.received[0].portManager, H().pm);
+    EXPECT_EQ(first.received[0].portManager, H().pm.Get());
 }
 
 TEST_F(PortManager, SinkThatNoLongerAnswersIsSkippedAndTheNextStillReceives) {
@@ -388,18 +388,17 @@ TEST_F(PortManager, ReleasingTheObjectReleasesConnectedSinks) {
     RecordingSink& sink = NewSink();
     H().Connect(sink);
     EXPECT_EQ(sink.refs.load(), 1u);
-    H().pm->Release();
-    H().pm = nullptr;
+    H().pm.Reset();
     EXPECT_EQ(sink.refs.load(), 0u);
 }
 
 TEST_F(PortManager, EventObjectKeepsThePortManagerAndAcceptsANullPut) {
     ComPtr<IPortManagerUpdateEvent> kept;
     ASSERT_EQ(portmanager::PortManagerUpdateEvent::Create(kept.GetAddressOf()), S_OK);
-    ASSERT_EQ(kept->put_PortManager(H().pm), S_OK);
+    ASSERT_EQ(kept->put_PortManager(H().pm.Get()), S_OK);
     ComPtr<IAdvancedPortManager> pm;
     ASSERT_EQ(kept->get_PortManager(pm.GetAddressOf()), S_OK);
-    EXPECT_EQ(pm.Get(), H().pm);
+    EXPECT_EQ(pm.Get(), H().pm.Get());
     EXPECT_EQ(kept->put_PortManager(nullptr), S_OK);
     EXPECT_EQ(kept->get_PortManager(pm.GetAddressOf()), E_POINTER);
     EXPECT_FALSE(pm);

@@ -330,8 +330,7 @@ TEST_F(Profiles, EveryDescriptorIsClosedAtFinalRelease) {
     Release(m);
     EXPECT_GT(platform::CountOpenDescriptors(), descriptorsAtStart + 10);  // the pools hold ports
     provider.Reset();
-    h.pm->Release();
-    h.pm = nullptr;
+    h.pm.Reset();
     EXPECT_EQ(platform::CountOpenDescriptors(), descriptorsAtStart + 1);  // the SIP server's
 }
 

@@ -36,16 +36,16 @@ HRESULT CAdvancedPortManager::CreateInstance(REFIID riid, void** ppv,
         return E_POINTER;
     }
     *ppv = nullptr;
-    auto* object = new (std::nothrow) CAdvancedPortManager(std::move(services));
-    if (object == nullptr) {
+    // Held through a failed construction or query; the caller's reference comes from the query.
+    const ComPtr<CAdvancedPortManager> object(new (std::nothrow)
+                                                  CAdvancedPortManager(std::move(services)));
+    if (!object) {
         return E_OUTOFMEMORY;
     }
-    object->AddRef();  // keeps it alive through a failed construction or query
     HRESULT hr = object->FinalConstruct();
     if (SUCCEEDED(hr)) {
         hr = object->QueryInterface(riid, ppv);
     }
-    object->Release();
     return hr;
 }
 

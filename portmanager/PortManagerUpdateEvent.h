@@ -4,6 +4,7 @@
 
 #include <atomic>
 
+#include <nqportmanager/ComPtr.h>
 #include <nqportmanager/NqPortManager.h>
 
 #include "portmanager/Dispatch.h"
@@ -24,10 +25,10 @@ class PortManagerUpdateEvent final : public NoTypeInfoDispatch<IPortManagerUpdat
 
   private:
     PortManagerUpdateEvent() = default;
-    ~PortManagerUpdateEvent();
+    ~PortManagerUpdateEvent() = default;
 
     std::atomic<ULONG> m_refs{0};
-    IUnknown* m_portManager = nullptr;  // owned reference, or null
+    ComPtr<IUnknown> m_portManager;
 };
 
 }  // namespace portmanager

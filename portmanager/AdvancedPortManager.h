@@ -12,6 +12,7 @@
 
 #include <nqportmanager/NqPortManager.h>
 
+#include "foundation/ModuleLock.h"
 #include "foundation/NetworkChangeMonitor.h"
 #include "platform/message.h"
 #include "platform/netinfo.h"
@@ -64,9 +65,15 @@ class CAdvancedPortManager final : public ISupportErrorInfo,
                                    public foundation::INetworkChangeSink {
   public:
     // Creates the object (hidden window included) on the calling thread and returns the asked
-    // interface. E_FAIL when the window cannot be created.
-    static HRESULT CreateInstance(REFIID riid, void** ppv,
+    // interface. E_FAIL when the window cannot be created. With an outer object the port manager
+    // is aggregated: only IID_IUnknown may be asked (else CLASS_E_NOAGGREGATION), the outer gets
+    // the inner, non-delegating IUnknown, and every other interface delegates to the outer.
+    static HRESULT CreateInstance(IUnknown* outer, REFIID riid, void** ppv,
                                   PortManagerServices services = PortManagerServices::Default());
+    static HRESULT CreateInstance(REFIID riid, void** ppv,
+                                  PortManagerServices services = PortManagerServices::Default()) {
+        return CreateInstance(nullptr, riid, ppv, std::move(services));
+    }
 
     // IUnknown
     HRESULT QueryInterface(REFIID riid, void** ppv) override;
@@ -154,7 +161,17 @@ class CAdvancedPortManager final : public ISupportErrorInfo,
                                  platform::LPARAM lParam, bool& handled) override;
 
   private:
-    explicit CAdvancedPortManager(PortManagerServices services);
+    // The object's own reference count and interface table. It is the controlling unknown unless
+    // an outer object aggregates the port manager.
+    struct InnerUnknown final : IUnknown {
+        explicit InnerUnknown(CAdvancedPortManager& owner) : owner(owner) {}
+        HRESULT QueryInterface(REFIID riid, void** ppv) override;
+        ULONG AddRef() override;
+        ULONG Release() override;
+        CAdvancedPortManager& owner;
+    };
+
+    CAdvancedPortManager(PortManagerServices services, IUnknown* outer);
     ~CAdvancedPortManager() override;
 
     HRESULT FinalConstruct();
@@ -176,6 +193,9 @@ class CAdvancedPortManager final : public ISupportErrorInfo,
     void Apply(DiscoveryOutcome outcome);
 
     std::atomic<ULONG> m_refs{0};
+    InnerUnknown m_inner{*this};
+    IUnknown* m_controlling;  // the outer object, or m_inner
+    foundation::ModuleReference m_moduleLock;
     PortManagerServices m_services;
     ConnectionPoint<_IAdvancedPortManagerEvents> m_events{DIID__IAdvancedPortManagerEvents};
     // A copy of the window handle for the monitor's thread, cleared before the window goes.

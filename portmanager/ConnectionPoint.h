@@ -10,6 +10,8 @@
 #include <nqportmanager/ComPtr.h>
 #include <nqportmanager/NqPortManager.h>
 
+#include "portmanager/Enumerators.h"
+
 namespace portmanager {
 
 template <typename Events>
@@ -57,6 +59,21 @@ class ConnectionPoint {
         // Moved out first: the sink's release may call back into this point.
         ComPtr<IUnknown> gone = std::move(m_slots[cookie - 1]);
         return S_OK;
+    }
+
+    // An enumerator over the live connections, in cookie order.
+    HRESULT EnumConnections(IEnumConnections** out) const {
+        std::vector<ConnectionEntry> live;
+        try {
+            for (size_t i = 0; i < m_slots.size(); ++i) {
+                if (m_slots[i]) {
+                    live.push_back({m_slots[i], static_cast<DWORD>(i + 1)});
+                }
+            }
+        } catch (const std::bad_alloc&) {
+            return E_OUTOFMEMORY;
+        }
+        return ConnectionsEnum::Create(std::move(live), out);
     }
 
     // call(Events*) for every sink, in slot order. Sinks that connect meanwhile beyond the slots

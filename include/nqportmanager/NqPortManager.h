@@ -157,3 +157,14 @@ NQ_DECLARE_COM_IID(INqDiagnostics, IID_INqDiagnostics);
 NQ_DECLARE_COM_IID(_IAdvancedPortManagerEvents, DIID__IAdvancedPortManagerEvents);
 NQ_DECLARE_COM_IID(IPortManagerUpdateEvent, IID_IPortManagerUpdateEvent);
 NQ_DECLARE_COM_IID(IPortMappingProvider, IID_IPortMappingProvider);
+
+// The module's entry points, as a COM in-process server exports them (libNqPortManager.so).
+#ifndef NQ_MODULE_EXPORT
+#define NQ_MODULE_EXPORT
+#endif
+extern "C" {
+NQ_MODULE_EXPORT HRESULT DllGetClassObject(REFCLSID rclsid, REFIID riid, void** ppv);
+NQ_MODULE_EXPORT HRESULT DllCanUnloadNow();
+NQ_MODULE_EXPORT HRESULT DllRegisterServer();
+NQ_MODULE_EXPORT HRESULT DllUnregisterServer();
+}

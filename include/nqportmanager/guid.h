@@ -96,6 +96,7 @@ std::string GuidToString(const GUID& guid);
 inline constexpr GUID GUID_NULL = {};
 inline constexpr IID IID_IUnknown = MakeGuid("00000000-0000-0000-C000-000000000046");
 inline constexpr IID IID_IDispatch = MakeGuid("00020400-0000-0000-C000-000000000046");
+inline constexpr IID IID_IClassFactory = MakeGuid("00000001-0000-0000-C000-000000000046");
 inline constexpr IID IID_IConnectionPointContainer =
     MakeGuid("B196B284-BAB4-101A-B69C-00AA00341D07");
 inline constexpr IID IID_IEnumConnectionPoints = MakeGuid("B196B285-BAB4-101A-B69C-00AA00341D07");

@@ -384,6 +384,45 @@ TEST_F(PortManager, AdviseAndUnadviseErrors) {
     EXPECT_EQ(iid, DIID__IAdvancedPortManagerEvents);
 }
 
+TEST_F(PortManager, EnumeratorsListTheOnePointAndEveryLiveConnection) {
+    ComPtr<IConnectionPointContainer> container;
+    ASSERT_EQ(H().pm->QueryInterface(IID_IConnectionPointContainer, container.GetVoidAddressOf()),
+              S_OK);
+    ComPtr<IEnumConnectionPoints> points;
+    ASSERT_EQ(container->EnumConnectionPoints(points.GetAddressOf()), S_OK);
+    IConnectionPoint* found[2] = {};
+    ULONG fetched = 9;
+    EXPECT_EQ(points->Next(2, found, &fetched), S_FALSE);
+    ASSERT_EQ(fetched, 1u);
+    const ComPtr<IConnectionPoint> point = ComPtr<IConnectionPoint>::Attach(found[0]);
+    IID iid{};
+    point->GetConnectionInterface(&iid);
+    EXPECT_EQ(iid, DIID__IAdvancedPortManagerEvents);
+    EXPECT_EQ(points->Next(2, found, nullptr), E_POINTER);
+
+    RecordingSink& first = NewSink();
+    RecordingSink& second = NewSink();
+    H().Connect(first);
+    const DWORD cookie = H().Connect(second);
+    ComPtr<IEnumConnections> connections;
+    ASSERT_EQ(point->EnumConnections(connections.GetAddressOf()), S_OK);
+    point->Unadvise(1);  // the snapshot keeps its own reference
+    EXPECT_EQ(first.refs.load(), 1u);
+    EXPECT_EQ(connections->Skip(1), S_OK);
+    ComPtr<IEnumConnections> clone;
+    ASSERT_EQ(connections->Clone(clone.GetAddressOf()), S_OK);
+    CONNECTDATA data{};
+    ASSERT_EQ(clone->Next(1, &data, nullptr), S_OK);
+    EXPECT_EQ(data.dwCookie, cookie);
+    EXPECT_EQ(data.pUnk, static_cast<IUnknown*>(&second));
+    data.pUnk->Release();
+    EXPECT_EQ(clone->Next(1, &data, nullptr), S_FALSE);
+    EXPECT_EQ(connections->Skip(2), S_FALSE);
+    connections.Reset();
+    clone.Reset();
+    EXPECT_EQ(first.refs.load(), 0u);
+}
+
 TEST_F(PortManager, ReleasingTheObjectReleasesConnectedSinks) {
     RecordingSink& sink = NewSink();
     H().Connect(sink);

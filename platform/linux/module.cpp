@@ -1,0 +1,19 @@
+#include "platform/module.h"
+
+#include <dlfcn.h>
+#include <limits.h>
+#include <stdlib.h>
+
+namespace platform {
+
+std::string ModuleFilePath(const void* address) {
+    Dl_info info{};
+    if (dladdr(address, &info) == 0 || info.dli_fname == nullptr) {
+        return {};
+    }
+    // The loader reports the name it was given; registration needs one that works from anywhere.
+    char resolved[PATH_MAX];
+    return realpath(info.dli_fname, resolved) != nullptr ? resolved : info.dli_fname;
+}
+
+}  // namespace platform

@@ -7,8 +7,8 @@
 #include "NqPortManager/Registration.h"
 #include "NqPortManager/Registry.h"
 #include "foundation/Logger.h"
-#include "foundation/ModuleLock.h"
 #include "platform/module.h"
+#include "platform/modulelock.h"
 #include "portmanager/AdvancedPortManager.h"
 
 namespace {
@@ -40,14 +40,14 @@ class ClassFactory final : public IClassFactory {
     ULONG AddRef() override {
         const ULONG refs = ++m_refs;
         if (refs == 1) {
-            foundation::LockModule();
+            platform::LockModule();
         }
         return refs;
     }
     ULONG Release() override {
         const ULONG refs = --m_refs;
         if (refs == 0) {
-            foundation::UnlockModule();
+            platform::UnlockModule();
         }
         return refs;
     }
@@ -60,9 +60,9 @@ class ClassFactory final : public IClassFactory {
     }
     HRESULT LockServer(INT lock) override {
         if (lock != 0) {
-            foundation::LockModule();
+            platform::LockModule();
         } else {
-            foundation::UnlockModule();
+            platform::UnlockModule();
         }
         return S_OK;
     }
@@ -118,7 +118,7 @@ NQ_MODULE_EXPORT HRESULT DllGetClassObject(REFCLSID rclsid, REFIID riid, void** 
 }
 
 NQ_MODULE_EXPORT HRESULT DllCanUnloadNow() {
-    return foundation::ModuleLockCount() == 0 ? S_OK : S_FALSE;
+    return platform::ModuleLockCount() == 0 ? S_OK : S_FALSE;
 }
 
 NQ_MODULE_EXPORT HRESULT DllRegisterServer() {

@@ -12,9 +12,9 @@
 
 #include <nqportmanager/NqPortManager.h>
 
-#include "foundation/ModuleLock.h"
 #include "foundation/NetworkChangeMonitor.h"
 #include "platform/message.h"
+#include "platform/modulelock.h"
 #include "platform/netinfo.h"
 #include "platform/upnp.h"
 #include "portmanager/ConnectionPoint.h"
@@ -195,7 +195,7 @@ class CAdvancedPortManager final : public ISupportErrorInfo,
     std::atomic<ULONG> m_refs{0};
     InnerUnknown m_inner{*this};
     IUnknown* m_controlling;  // the outer object, or m_inner
-    foundation::ModuleReference m_moduleLock;
+    platform::ModuleReference m_moduleLock;
     PortManagerServices m_services;
     ConnectionPoint<_IAdvancedPortManagerEvents> m_events{DIID__IAdvancedPortManagerEvents};
     // A copy of the window handle for the monitor's thread, cleared before the window goes.

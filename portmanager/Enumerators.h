@@ -13,7 +13,7 @@
 #include <nqportmanager/ComPtr.h>
 #include <nqportmanager/NqPortManager.h>
 
-#include "foundation/ModuleLock.h"
+#include "platform/modulelock.h"
 
 namespace portmanager {
 
@@ -119,7 +119,7 @@ class SnapshotEnum final : public IEnum {
     std::atomic<ULONG> m_refs{0};
     std::shared_ptr<const std::vector<Entry>> m_entries;
     size_t m_next;
-    foundation::ModuleReference m_lock;
+    platform::ModuleReference m_lock;
 };
 
 using ConnectionsEnum = SnapshotEnum<IEnumConnections, CONNECTDATA, ConnectionEntry>;

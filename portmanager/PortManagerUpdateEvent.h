@@ -7,7 +7,7 @@
 #include <nqportmanager/ComPtr.h>
 #include <nqportmanager/NqPortManager.h>
 
-#include "foundation/ModuleLock.h"
+#include "platform/modulelock.h"
 #include "portmanager/Dispatch.h"
 
 namespace portmanager {
@@ -30,7 +30,7 @@ class PortManagerUpdateEvent final : public NoTypeInfoDispatch<IPortManagerUpdat
 
     std::atomic<ULONG> m_refs{0};
     ComPtr<IUnknown> m_portManager;
-    foundation::ModuleReference m_moduleLock;
+    platform::ModuleReference m_moduleLock;
 };
 
 }  // namespace portmanager

@@ -5,13 +5,14 @@
 // the same on every platform. Strings are BSTRs, booleans VARIANT_BOOL, results HRESULTs.
 //
 // Threads: create the objects on one thread and call them only from it. That thread must pump its
-// message queue (platform::RunMessageLoop, or platform::PumpPendingMessages whenever
-// platform::MessageQueueDescriptor() is readable): discovery outcomes, keep-alive timers and
-// events all arrive through it, and events are fired on it.
+// message queue (NqRunMessageLoop, or NqPumpPendingMessages whenever NqMessageQueueDescriptor()
+// is readable; see messageloop.h): discovery outcomes, keep-alive timers and events all arrive
+// through it, and events are fired on it.
 #pragma once
 
 #include <nqportmanager/ComPtr.h>
 #include <nqportmanager/com.h>
+#include <nqportmanager/messageloop.h>
 
 enum PM_STATE : int32_t {
     PMS_UNINITIALIZED = 0,
@@ -159,9 +160,6 @@ NQ_DECLARE_COM_IID(IPortManagerUpdateEvent, IID_IPortManagerUpdateEvent);
 NQ_DECLARE_COM_IID(IPortMappingProvider, IID_IPortMappingProvider);
 
 // The module's entry points, as a COM in-process server exports them (libNqPortManager.so).
-#ifndef NQ_MODULE_EXPORT
-#define NQ_MODULE_EXPORT
-#endif
 extern "C" {
 NQ_MODULE_EXPORT HRESULT DllGetClassObject(REFCLSID rclsid, REFIID riid, void** ppv);
 NQ_MODULE_EXPORT HRESULT DllCanUnloadNow();

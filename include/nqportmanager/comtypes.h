@@ -3,6 +3,11 @@
 // needs is provided.
 #pragma once
 
+// Marks what the module exports; the module's own build defines it, a client sees nothing.
+#ifndef NQ_MODULE_EXPORT
+#define NQ_MODULE_EXPORT
+#endif
+
 #include <cstdint>
 
 // ---- Basic types -----------------------------------------------------------------------------

@@ -70,8 +70,27 @@ TEST_F(Module, ExportsExactlyItsEntryPoints) {
     for (std::string address, kind, name; lines >> address >> kind >> name;) {
         names.insert(name);
     }
-    EXPECT_EQ(names, (std::set<std::string>{"DllCanUnloadNow", "DllGetClassObject",
-                                            "DllRegisterServer", "DllUnregisterServer"}));
+    // The entry points and the small C API a client needs beside them, nothing else.
+    const std::set<std::string> expected = {"DllGetClassObject",     "DllCanUnloadNow",
+                                            "DllRegisterServer",     "DllUnregisterServer",
+                                            "SysAllocString",        "SysAllocStringLen",
+                                            "SysAllocStringByteLen", "SysReAllocString",
+                                            "SysReAllocStringLen",   "SysFreeString",
+                                            "SysStringLen",          "SysStringByteLen",
+                                            "VariantInit",           "VariantClear",
+                                            "VariantCopy",           "SafeArrayCreate",
+                                            "SafeArrayCreateVector", "SafeArrayDestroy",
+                                            "SafeArrayGetDim",       "SafeArrayGetElemsize",
+                                            "SafeArrayGetLBound",    "SafeArrayGetUBound",
+                                            "SafeArrayGetElement",   "SafeArrayPutElement",
+                                            "SafeArrayGetVartype",   "SafeArrayLock",
+                                            "SafeArrayUnlock",       "SafeArrayAccessData",
+                                            "SafeArrayUnaccessData", "SafeArrayCopy",
+                                            "CreateErrorInfo",       "SetErrorInfo",
+                                            "GetErrorInfo",          "NqMessageQueueDescriptor",
+                                            "NqPumpPendingMessages", "NqRunMessageLoopUntil",
+                                            "NqRunMessageLoop",      "NqQuitMessageLoop"};
+    EXPECT_EQ(names, expected);
 }
 
 TEST_F(Module, ClassTableFactoriesAndTheLockCount) {

@@ -2,7 +2,7 @@
 // it is above zero a client must not unload the module.
 #pragma once
 
-namespace foundation {
+namespace platform {
 
 long ModuleLockCount();
 void LockModule();
@@ -17,4 +17,4 @@ class ModuleReference {
     ~ModuleReference() { UnlockModule(); }
 };
 
-}  // namespace foundation
+}  // namespace platform

@@ -1,8 +1,8 @@
-#include "foundation/ModuleLock.h"
+#include "platform/modulelock.h"
 
 #include <atomic>
 
-namespace foundation {
+namespace platform {
 
 namespace {
 std::atomic<long> g_locks{0};
@@ -20,4 +20,4 @@ void UnlockModule() {
     --g_locks;
 }
 
-}  // namespace foundation
+}  // namespace platform

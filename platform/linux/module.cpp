@@ -17,3 +17,24 @@ std::string ModuleFilePath(const void* address) {
 }
 
 }  // namespace platform
+
+namespace platform {
+
+void* LoadModule(const std::string& path, std::string& error) {
+    void* module = dlopen(path.c_str(), RTLD_NOW | RTLD_LOCAL);
+    if (module == nullptr) {
+        const char* why = dlerror();
+        error = why != nullptr ? why : "cannot load " + path;
+    }
+    return module;
+}
+
+void* ModuleSymbol(void* module, const char* name) {
+    return module != nullptr ? dlsym(module, name) : nullptr;
+}
+
+bool UnloadModule(void* module) {
+    return module != nullptr && dlclose(module) == 0;
+}
+
+}  // namespace platform

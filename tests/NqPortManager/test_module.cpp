@@ -13,6 +13,7 @@
 #include <string>
 
 #include <nqportmanager/NqPortManager.h>
+#include <nqportmanager/client.h>
 
 #include "NqPortManager/Registry.h"
 #include "tests/support/os/command.h"
@@ -202,8 +203,28 @@ TEST_F(Module, RegistrationRoundTripsInTheRegistryFileAndRefusesABrokenOne) {
               GuidToString(LIBID_NqPortManagerLib));
     ASSERT_EQ(register_(), S_OK) << "twice";
 
+    // A client that knows only the ProgID finds, loads and creates the class.
+    CLSID found{};
+    ASSERT_EQ(nqportmanager::CLSIDFromProgID("NqPortManager.AdvancedPortManager", found), S_OK);
+    EXPECT_EQ(found, CLSID_AdvancedPortManager);
+    EXPECT_EQ(nqportmanager::CLSIDFromProgID("NqPortManager.Nothing", found), REGDB_E_CLASSNOTREG);
+    nqportmanager::Module module;
+    ASSERT_EQ(nqportmanager::Module::LoadForClass(found, "", module), S_OK);
+    ComPtr<IAdvancedPortManager> pm;
+    ASSERT_EQ(
+        module.CreateInstance(found, nullptr, IID_IAdvancedPortManager, pm.GetVoidAddressOf()),
+        S_OK);
+    EXPECT_FALSE(module.Unload()) << "an object of it lives";
+    pm.Reset();
+    EXPECT_TRUE(module.Unload());
+
     ASSERT_EQ(unregister_(), S_OK);
     ASSERT_TRUE(registry::ReadRegistryFile(file, root, error)) << error;
+    EXPECT_EQ(nqportmanager::Module::LoadForClass(CLSID_AdvancedPortManager, "", module),
+              REGDB_E_CLASSNOTREG);
+    EXPECT_EQ(nqportmanager::Module::LoadForClass(CLSID_AdvancedPortManager, kModule, module), S_OK)
+        << "the fall-back";
+    EXPECT_TRUE(module.Unload());
     for (const char* kept : {"AppID", "CLSID", "TypeLib"}) {
         ASSERT_NE(root.Find(kept), nullptr) << kept;
         EXPECT_TRUE(root.Find(kept)->subkeys.empty()) << kept;

@@ -42,5 +42,7 @@ class FileLock {
 std::string UserDataFolder();
 // The value of an environment variable, empty when it is not set.
 std::string EnvironmentValue(const char* name);
+// Sets it for this process and the children it starts.
+bool SetEnvironmentValue(const char* name, const std::string& value);
 
 }  // namespace platform

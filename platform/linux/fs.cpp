@@ -137,6 +137,10 @@ std::string EnvironmentValue(const char* name) {
     return value != nullptr ? value : "";
 }
 
+bool SetEnvironmentValue(const char* name, const std::string& value) {
+    return setenv(name, value.c_str(), 1) == 0;
+}
+
 std::string UserDataFolder() {
     const std::string xdg = EnvironmentValue("XDG_DATA_HOME");
     if (!xdg.empty() && xdg.front() == '/') {  // relative values are ignored, as XDG says

@@ -63,7 +63,9 @@ bool ValueFromJson(const nlohmann::json& j, RegistryValue& v) {
     if (!j.is_object() || j.size() != 1) {
         return false;
     }
-    const auto& [type, data] = *j.items().begin();
+    const auto only = j.begin();
+    const std::string& type = only.key();
+    const nlohmann::json& data = only.value();
     if (type == "s" && data.is_string()) {
         v = {RegistryValue::Type::kString, data.get<std::string>(), 0, {}};
         return true;

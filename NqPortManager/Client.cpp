@@ -42,9 +42,10 @@ HRESULT Module::Load(const std::string& path, Module& module, std::string* error
     Find(handle, "NqMessageQueueDescriptor", loaded.m_queueDescriptor);
     Find(handle, "NqPumpPendingMessages", loaded.m_pump);
     Find(handle, "NqRunMessageLoopUntil", loaded.m_runUntil);
+    Find(handle, "NqSetDebugOutputSink", loaded.m_setDebugOutput);
     if (loaded.m_getClassObject == nullptr || loaded.m_canUnloadNow == nullptr ||
         loaded.m_queueDescriptor == nullptr || loaded.m_pump == nullptr ||
-        loaded.m_runUntil == nullptr) {
+        loaded.m_runUntil == nullptr || loaded.m_setDebugOutput == nullptr) {
         platform::UnloadModule(handle);
         Report(error, path + " is not an NqPortManager module");
         return E_FAIL;
@@ -112,6 +113,13 @@ int Module::PumpPendingMessages() const {
 
 int Module::RunMessageLoopUntil(int (*done)(void* context), void* context, int timeoutMs) const {
     return m_runUntil != nullptr ? m_runUntil(done, context, timeoutMs) : 0;
+}
+
+void Module::SetDebugOutputSink(void (*sink)(const char* line, size_t length, void* context),
+                                void* context) const {
+    if (m_setDebugOutput != nullptr) {
+        m_setDebugOutput(sink, context);
+    }
 }
 
 HRESULT CLSIDFromProgID(const std::string& progId, CLSID& clsid, const std::string& registryPath) {

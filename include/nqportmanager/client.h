@@ -34,6 +34,9 @@ class Module {
     int MessageQueueDescriptor() const;
     int PumpPendingMessages() const;
     int RunMessageLoopUntil(int (*done)(void* context), void* context, int timeoutMs) const;
+    // Where the module's debugger output goes (see messageloop.h).
+    void SetDebugOutputSink(void (*sink)(const char* line, size_t length, void* context),
+                            void* context) const;
 
   private:
     void* m_handle = nullptr;
@@ -43,6 +46,7 @@ class Module {
     int (*m_queueDescriptor)() = nullptr;
     int (*m_pump)() = nullptr;
     int (*m_runUntil)(int (*)(void*), void*, int) = nullptr;
+    void (*m_setDebugOutput)(void (*)(const char*, size_t, void*), void*) = nullptr;
 };
 
 // The class id registered under a ProgID ("NqPortManager.AdvancedPortManager", with or without

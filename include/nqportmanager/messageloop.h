@@ -6,6 +6,8 @@
 
 #include <nqportmanager/comtypes.h>
 
+#include <cstddef>
+
 extern "C" {
 // Readable while a message is queued or a timer is due for this thread.
 NQ_MODULE_EXPORT int NqMessageQueueDescriptor();
@@ -18,4 +20,11 @@ NQ_MODULE_EXPORT int NqRunMessageLoopUntil(int (*done)(void* context), void* con
 // Pumps until NqQuitMessageLoop() is called on this thread.
 NQ_MODULE_EXPORT void NqRunMessageLoop();
 NQ_MODULE_EXPORT void NqQuitMessageLoop();
+
+// Where the module's debugger output goes (the logger's lines, as Windows sends them to
+// OutputDebugString): to sink, called on the logging thread with one line and its length; null
+// discards it, as without a debugger.
+NQ_MODULE_EXPORT void NqSetDebugOutputSink(void (*sink)(const char* line, size_t length,
+                                                        void* context),
+                                           void* context);
 }  // extern "C"

@@ -90,7 +90,8 @@ TEST_F(Module, ExportsExactlyItsEntryPoints) {
                                             "CreateErrorInfo",       "SetErrorInfo",
                                             "GetErrorInfo",          "NqMessageQueueDescriptor",
                                             "NqPumpPendingMessages", "NqRunMessageLoopUntil",
-                                            "NqRunMessageLoop",      "NqQuitMessageLoop"};
+                                            "NqRunMessageLoop",      "NqQuitMessageLoop",
+                                            "NqSetDebugOutputSink"};
     EXPECT_EQ(names, expected);
 }
 

@@ -1,6 +1,9 @@
-// The client's view of the calling thread's message loop.
+// The client's view of the calling thread's message loop, and of the module's debugger output.
 #include <nqportmanager/messageloop.h>
 
+#include <string_view>
+
+#include "platform/kernel.h"
 #include "platform/message.h"
 
 extern "C" {
@@ -26,6 +29,16 @@ void NqRunMessageLoop() {
 
 void NqQuitMessageLoop() {
     platform::QuitMessageLoop();
+}
+
+void NqSetDebugOutputSink(void (*sink)(const char* line, size_t length, void* context),
+                          void* context) {
+    if (sink == nullptr) {
+        platform::SetDebugOutputSink(nullptr);
+        return;
+    }
+    platform::SetDebugOutputSink(
+        [sink, context](std::string_view line) { sink(line.data(), line.size(), context); });
 }
 
 }  // extern "C"

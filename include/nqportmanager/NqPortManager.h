@@ -39,6 +39,72 @@ enum PM_EVENT : int32_t {
     PME_DIAGNOSTIC_COMPLETED = 3,
 };
 
+// Result codes of a diagnostic run. The numbers are what a run reports; for 2 to 10 the names
+// do not tell the condition (4: no route to the Internet, 3: no gateway, 7 and 8: name
+// resolution, 9 and 10: the UDP port 3478 test). ErrorText of the event gives the meaning.
+enum PM_DIAGNOSTIC_RESULT : int32_t {
+    PMDR_NO_ERROR = 0,
+    PMDR_TEST_NOT_RUN = 1,
+    PMDR_NO_INTERFACE_WITH_GATEWAY = 2,
+    PMDR_NO_INTERFACE_WITH_ROUTE = 3,
+    PMDR_TIMEOUT = 4,
+    PMDR_CANT_ICMP = 5,
+    PMDR_CANT_RESOLVE_NOQUA_UDP_SERVER = 6,
+    PMDR_CANT_RESOLVE_ROOT_DNS_SERVER = 7,
+    PMDR_CANT_CONVERT_LOCAL_IP_ADDRESS = 8,
+    PMDR_CANT_CONTACT_STUN_SERVER_ON_UDP_PORT_3478 = 9,
+    PMDR_CANT_RESOLVE_NOQUA_TCP_SERVER = 10,
+    PMDR_CANT_CREATE_TCP_SOCKET = 11,
+    PMDR_CANT_LOAD_ICMP_LIBRARY = 12,
+    PMDR_CANT_FIND_SENDECHO2_PROCADDR = 13,
+    PMDR_CANT_CONNECT_TO_ECHO_SERVER = 14,
+    PMDR_ECHO_SERVER_LOGIN_SEND_FAILED = 15,
+    PMDR_ECHO_SERVER_LOGIN_RECV_FAILED = 16,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_MISSING_STATUS = 17,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_FAILED_STATUS = 18,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_MISSING_SESSIONID = 19,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_MISSING_SIPPORT = 20,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_MISSING_AUDIORTP = 21,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_MISSING_AUDIORTCP = 22,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_MISSING_VIDEORTP = 23,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_MISSING_VIDEORTCP = 24,
+    PMDR_ECHO_SERVER_CANT_ALLOCATE_SIP_SOCKET = 25,
+    PMDR_ECHO_SERVER_CANT_ALLOCATE_MEDIA_SOCKET = 26,
+    PMDR_ECHO_SERVER_SIP_UDP_SEND_FAILED = 27,
+    PMDR_ECHO_SERVER_SIP_UDP_RECV_FAILED = 28,
+    PMDR_ECHO_SERVER_SIP_TCP_SEND_FAILED = 29,
+    PMDR_ECHO_SERVER_SIP_TCP_RECV_FAILED = 30,
+    PMDR_ECHO_SERVER_SIP_NO_UDP_OR_TCP = 31,
+    PMDR_ECHO_SERVER_SIP_NO_UDP = 32,
+    PMDR_ECHO_SERVER_SIP_NO_TCP = 33,
+    PMDR_ECHO_SERVER_SIP_MALFORMED_TCP_PACKET = 34,
+    PMDR_ECHO_SERVER_SIP_UDP_DIFFERENT_LENGTH = 35,
+    PMDR_ECHO_SERVER_SIP_UDP_DATA_DIFFERENT = 36,
+    PMDR_ECHO_SERVER_SIP_TCP_PACKETS_DIFFERENT = 37,
+    PMDR_ECHO_SERVER_SIP_TCP_PACKETS_DIFFERENT_SIZE = 38,
+    PMDR_ECHO_SERVER_LOGIN_RECV_FAILED_TIMEOUT = 39,
+    PMDR_ECHO_SERVER_TCP_SET_ASYNC_FAILED = 40,
+    PMDR_ECHO_SERVER_UDP_SET_ASYNC_FAILED = 41,
+    PMDR_ECHO_SERVER_CANT_RESOLVE_NAME = 42,
+    PMDR_ECHO_SERVER_LAST_ERROR = 43,
+};
+
+// The tests of a diagnostic run.
+enum PM_DIAGNOSTIC_TEST_TYPE : int32_t {
+    PMNTT_TEST_LOCATE_INTERFACE = 0,
+    PMNTT_TEST_PING_GATEWAY = 1,  // not run: its entry stays PMDR_TEST_NOT_RUN
+    PMNTT_TEST_DNS = 2,
+    PMNTT_TEST_STUN = 3,
+    PMNTT_TEST_ECHO = 4,
+    PMNTT_TEST_ECHO_SIP = 5,
+    PMNTT_TEST_ECHO_SIP_INVITE_REQUEST = 6,
+    PMNTT_TEST_ECHO_SIP_INVITE_RESPONSE = 7,
+    PMNTT_TEST_ECHO_SIP_REGISTER_REQUEST = 8,
+    PMNTT_TEST_ECHO_SIP_REGISTER_RESPONSE = 9,
+    PMNTT_TEST_ECHO_MEDIA = 10,
+    PMNTT_TEST_ECHO_MEDIA_LARGE_PACKET = 11,
+};
+
 // The type argument of IPortMappingProvider::GetMapping.
 enum PortMappingType : int32_t {
     AudioRTP = 0,
@@ -102,6 +168,16 @@ struct IAdvancedPortManager : public IDispatch {
     // networkAddresses: a VARIANT of type VT_ARRAY | VT_BSTR, one "address[:port]" per element.
     virtual HRESULT OnBeforeEnableProfileEx(VARIANT networkAddresses, LONG minPort, LONG maxPort,
                                             LONG portsPerProtocol, VARIANT_BOOL randomizePorts) = 0;
+    // Starts a diagnostic run on a thread of its own and returns at once; its outcome arrives as
+    // PME_DIAGNOSTIC_COMPLETED with an INetworkDiagnosticEvent carrying the cookie. The run
+    // locates the interface toward the well-known address (a dotted quad), checks its gateway,
+    // resolves the STUN server, asks it on UDP port 3478, then logs in to the echo server
+    // (host[:port given apart]) and checks SIP and media echoes; timeout (ms) bounds every wait.
+    // E_POINTER for a null string, E_INVALIDARG for a port outside 1..65534 or a negative
+    // timeout. Several runs may go on at once; Shutdown and the final release stop and wait for
+    // them (a stopped run fires nothing).
+    // The media echo sends 1398 bytes starting with "Call-ID: <session id>\r\n"; a session id
+    // too long for that line is cut so that the payload stays 1398 bytes.
     virtual HRESULT DiagnoseNetwork(BSTR bstrWellKnownNetworkAddress, BSTR bstrStunServer,
                                     BSTR bstrEchoServer, INT nEchoServerPort, LONG timeout,
                                     LONG cookie) = 0;
@@ -135,6 +211,18 @@ struct IPortManagerUpdateEvent : public IDispatch {
     virtual HRESULT put_PortManager(IAdvancedPortManager* newVal) = 0;
 };
 
+// Travels with PME_DIAGNOSTIC_COMPLETED: the test recorded last (the failing one, or the last
+// test of a clean run) and the cookie given to DiagnoseNetwork. Every getter gives E_POINTER
+// for a null out argument; returned BSTRs belong to the caller.
+struct INetworkDiagnosticEvent : public IDispatch {
+    virtual HRESULT get_errorCode(PM_DIAGNOSTIC_RESULT* pVal) = 0;
+    virtual HRESULT get_ErrorText(BSTR* pVal) = 0;
+    virtual HRESULT get_TestType(PM_DIAGNOSTIC_TEST_TYPE* pVal) = 0;
+    virtual HRESULT get_TestTypeText(BSTR* pVal) = 0;
+    virtual HRESULT get_AdditionalInfo(BSTR* pVal) = 0;
+    virtual HRESULT get_cookie(LONG* pVal) = 0;
+};
+
 // Port mappings of the port manager (query it from IAdvancedPortManager).
 struct IPortMappingProvider : public IUnknown {
     // type: a PortMappingType. Returned BSTRs belong to the caller.
@@ -157,3 +245,4 @@ NQ_DECLARE_COM_IID(INqDiagnostics, IID_INqDiagnostics);
 NQ_DECLARE_COM_IID(_IAdvancedPortManagerEvents, DIID__IAdvancedPortManagerEvents);
 NQ_DECLARE_COM_IID(IPortManagerUpdateEvent, IID_IPortManagerUpdateEvent);
 NQ_DECLARE_COM_IID(IPortMappingProvider, IID_IPortMappingProvider);
+NQ_DECLARE_COM_IID(INetworkDiagnosticEvent, IID_INetworkDiagnosticEvent);

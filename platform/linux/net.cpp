@@ -2,8 +2,10 @@
 
 #include <arpa/inet.h>
 #include <dirent.h>
+#include <fcntl.h>
 #include <netdb.h>
 #include <netinet/in.h>
+#include <poll.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -200,6 +202,79 @@ int ReceiveFrom(SocketHandle s, void* buffer, size_t capacity, uint32_t* fromHos
     }
     if (fromPort != nullptr) {
         *fromPort = ntohs(sa.sin_port);
+    }
+    return static_cast<int>(n);
+}
+
+int ConnectSocket(SocketHandle s, uint32_t hostAddress, uint16_t port, int timeoutMs) {
+    const sockaddr_in sa = MakeAddress(hostAddress, port);
+    const int flags = fcntl(s, F_GETFL);
+    if (flags < 0 || fcntl(s, F_SETFL, flags | O_NONBLOCK) != 0) {
+        return SetError(errno);
+    }
+    int result = 0;
+    if (connect(s, reinterpret_cast<const sockaddr*>(&sa), sizeof sa) != 0) {
+        if (errno != EINPROGRESS) {
+            result = SetError(errno);
+        } else {
+            // Writable once the handshake ended either way; the stop source wakes us too.
+            const StopSource* stop = CurrentStopSource();
+            pollfd fds[2] = {{s, POLLOUT, 0},
+                             {stop != nullptr ? stop->Descriptor() : -1, POLLIN, 0}};
+            const uint64_t deadline =
+                GetTickCount64() + static_cast<uint64_t>(timeoutMs < 0 ? 0 : timeoutMs);
+            for (;;) {
+                int wait = -1;
+                if (timeoutMs >= 0) {
+                    const uint64_t now = GetTickCount64();
+                    wait = now >= deadline ? 0 : static_cast<int>(deadline - now);
+                }
+                const int r = poll(fds, 2, wait);
+                if (r < 0 && errno == EINTR) {
+                    continue;
+                }
+                if (r < 0) {
+                    result = SetError(errno);
+                } else if (r == 0) {
+                    result = SetError(kErrTimedOut);
+                } else if ((fds[1].revents & POLLIN) != 0) {
+                    result = SetError(kErrInterrupted);
+                } else {
+                    int error = 0;
+                    socklen_t len = sizeof error;
+                    if (getsockopt(s, SOL_SOCKET, SO_ERROR, &error, &len) != 0) {
+                        error = errno;
+                    }
+                    result = error != 0 ? SetError(error) : 0;
+                }
+                break;
+            }
+        }
+    }
+    fcntl(s, F_SETFL, flags);
+    return result;
+}
+
+int Send(SocketHandle s, const void* data, size_t length) {
+    const ssize_t n = send(s, data, length, MSG_NOSIGNAL);
+    if (n < 0) {
+        return SetError(errno);
+    }
+    return static_cast<int>(n);
+}
+
+int Receive(SocketHandle s, void* buffer, size_t capacity) {
+    iovec part{buffer, capacity};
+    msghdr message{};
+    message.msg_iov = &part;
+    message.msg_iovlen = 1;
+    const ssize_t n = recvmsg(s, &message, 0);
+    if (n < 0) {
+        return SetError(errno);
+    }
+    // Only datagram sockets set it: the rest of that datagram is gone.
+    if ((message.msg_flags & MSG_TRUNC) != 0) {
+        return SetError(kErrMessageSize);
     }
     return static_cast<int>(n);
 }

@@ -1,0 +1,74 @@
+// A diagnostic run: on a thread of its own it checks the interface toward a well-known address,
+// its gateway, name resolution, STUN on UDP port 3478 and the echo server, then posts its result
+// to the window that asked. DiagnosticRuns owns the threads of one window's runs.
+#pragma once
+
+#include <cstdint>
+#include <list>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "diagnostics/DiagnosticResult.h"
+#include "platform/kernel.h"
+#include "platform/message.h"
+#include "platform/netinfo.h"
+
+namespace diagnostics {
+
+// The name the DNS test falls back on to tell "this name failed" from "no name resolves".
+inline constexpr const char* kPublicHostName = "a.root-servers.net";
+inline constexpr uint16_t kStunTestPort = 3478;
+
+struct DiagnosticRequest {
+    platform::WindowHandle m_window = nullptr;
+    platform::UINT m_message = 0;
+    int32_t m_cookie = 0;
+    std::string m_wellKnownNetworkAddress;
+    std::string m_stunServer;
+    std::string m_echoServer;
+    uint16_t m_echoServerPort = 0;
+    uint32_t m_timeout = 0;
+};
+
+// What a run asks the system; the system's by default, and whatever is given outlives the runs.
+struct DiagnosticServices {
+    platform::NetworkInfo* networkInfo = &platform::SystemNetworkInfo();
+    platform::RouteLookup* routeLookup = &platform::SystemRouteLookup();
+};
+
+// The test sequence; stops at the first failing test, every outcome recorded in result.
+void RunTestSequence(const DiagnosticRequest& request, DiagnosticResult& result,
+                     const DiagnosticServices& services);
+
+// The runs of one window, each on its own thread. Used on the window's thread; the threads only
+// hand over their results.
+class DiagnosticRuns {
+  public:
+    DiagnosticRuns() = default;
+    // Stops and joins every run, then frees results whose message was never handled.
+    ~DiagnosticRuns();
+    DiagnosticRuns(const DiagnosticRuns&) = delete;
+    DiagnosticRuns& operator=(const DiagnosticRuns&) = delete;
+
+    // Starts a run that posts (request.m_message, result, 0) to request.m_window when it ends.
+    // 0, or the system's error when no thread could be created.
+    int Start(DiagnosticRequest request, const DiagnosticServices& services);
+    // The result a run posted as wParam, now the caller's; null for anything else.
+    std::unique_ptr<DiagnosticResult> TakePosted(platform::WPARAM wParam);
+    // Asks every run to stop and waits for it. A stopped run posts nothing.
+    void StopAll();
+    // Runs whose thread has not been joined yet.
+    size_t Active();
+
+  private:
+    void Post(const DiagnosticRequest& request, const DiagnosticResult& result);
+    void JoinFinished();
+
+    std::list<platform::Thread> m_threads;
+    std::mutex m_postedLock;
+    std::vector<std::unique_ptr<DiagnosticResult>> m_posted;  // posted and not yet taken
+};
+
+}  // namespace diagnostics

@@ -69,11 +69,12 @@ int DiagnosticRuns::Start(DiagnosticRequest request, const DiagnosticServices& s
     platform::Thread& thread = m_threads.emplace_back();
     errno = 0;
     const bool started = thread.Start([this, request = std::move(request), services] {
-        DiagnosticResult result;
-        RunTestSequence(request, result, services);
+        DiagnosticOutcome outcome;
+        outcome.m_cookie = request.m_cookie;
+        RunTestSequence(request, outcome.m_result, services);
         // The owner is going away or shutting down: nobody waits for this outcome.
         if (!platform::CurrentThreadStopRequested()) {
-            Post(request, result);
+            Post(request, std::move(outcome));
         }
     });
     if (!started) {
@@ -84,17 +85,17 @@ int DiagnosticRuns::Start(DiagnosticRequest request, const DiagnosticServices& s
     return 0;
 }
 
-void DiagnosticRuns::Post(const DiagnosticRequest& request, const DiagnosticResult& result) {
+void DiagnosticRuns::Post(const DiagnosticRequest& request, DiagnosticOutcome outcome) {
     std::lock_guard<std::mutex> lock(m_postedLock);
-    m_posted.push_back(std::make_unique<DiagnosticResult>(result));
+    m_posted.push_back(std::make_unique<DiagnosticOutcome>(std::move(outcome)));
     const auto wParam = reinterpret_cast<platform::WPARAM>(m_posted.back().get());
     if (!platform::PostMessage(request.m_window, request.m_message, wParam, 0)) {
         m_posted.pop_back();  // the window is gone: nobody will take it
     }
 }
 
-std::unique_ptr<DiagnosticResult> DiagnosticRuns::TakePosted(platform::WPARAM wParam) {
-    std::unique_ptr<DiagnosticResult> taken;
+std::unique_ptr<DiagnosticOutcome> DiagnosticRuns::TakePosted(platform::WPARAM wParam) {
+    std::unique_ptr<DiagnosticOutcome> taken;
     {
         std::lock_guard<std::mutex> lock(m_postedLock);
         for (auto it = m_posted.begin(); it != m_posted.end(); ++it) {

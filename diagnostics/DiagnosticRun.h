@@ -38,6 +38,12 @@ struct DiagnosticServices {
     platform::RouteLookup* routeLookup = &platform::SystemRouteLookup();
 };
 
+// What a run posts: its result, and the cookie the event must carry.
+struct DiagnosticOutcome {
+    DiagnosticResult m_result;
+    int32_t m_cookie = 0;
+};
+
 // The test sequence; stops at the first failing test, every outcome recorded in result.
 void RunTestSequence(const DiagnosticRequest& request, DiagnosticResult& result,
                      const DiagnosticServices& services);
@@ -47,28 +53,28 @@ void RunTestSequence(const DiagnosticRequest& request, DiagnosticResult& result,
 class DiagnosticRuns {
   public:
     DiagnosticRuns() = default;
-    // Stops and joins every run, then frees results whose message was never handled.
+    // Stops and joins every run, then frees outcomes whose message was never handled.
     ~DiagnosticRuns();
     DiagnosticRuns(const DiagnosticRuns&) = delete;
     DiagnosticRuns& operator=(const DiagnosticRuns&) = delete;
 
-    // Starts a run that posts (request.m_message, result, 0) to request.m_window when it ends.
+    // Starts a run that posts (request.m_message, outcome, 0) to request.m_window when it ends.
     // 0, or the system's error when no thread could be created.
     int Start(DiagnosticRequest request, const DiagnosticServices& services);
-    // The result a run posted as wParam, now the caller's; null for anything else.
-    std::unique_ptr<DiagnosticResult> TakePosted(platform::WPARAM wParam);
+    // The outcome a run posted as wParam, now the caller's; null for anything else.
+    std::unique_ptr<DiagnosticOutcome> TakePosted(platform::WPARAM wParam);
     // Asks every run to stop and waits for it. A stopped run posts nothing.
     void StopAll();
     // Runs whose thread has not been joined yet.
     size_t Active();
 
   private:
-    void Post(const DiagnosticRequest& request, const DiagnosticResult& result);
+    void Post(const DiagnosticRequest& request, DiagnosticOutcome outcome);
     void JoinFinished();
 
     std::list<platform::Thread> m_threads;
     std::mutex m_postedLock;
-    std::vector<std::unique_ptr<DiagnosticResult>> m_posted;  // posted and not yet taken
+    std::vector<std::unique_ptr<DiagnosticOutcome>> m_posted;  // posted and not yet taken
 };
 
 }  // namespace diagnostics

@@ -66,73 +66,72 @@ DiagnosticRuns::~DiagnosticRuns() {
 
 int DiagnosticRuns::Start(DiagnosticRequest request, const DiagnosticServices& services) {
     JoinFinished();
-    platform::Thread& thread = m_threads.emplace_back();
+    Run& run = m_runs.emplace_back();
+    run.id = m_nextRunId++;
     errno = 0;
-    const bool started = thread.Start([this, request = std::move(request), services] {
+    const bool started = run.thread.Start([this, &run, request = std::move(request), services] {
         DiagnosticOutcome outcome;
         outcome.m_cookie = request.m_cookie;
         RunTestSequence(request, outcome.m_result, services);
         // The owner is going away or shutting down: nobody waits for this outcome.
         if (!platform::CurrentThreadStopRequested()) {
-            Post(request, std::move(outcome));
+            Post(run, request, std::move(outcome));
         }
+        run.done.store(true);
     });
     if (!started) {
         const int error = errno != 0 ? errno : EAGAIN;
-        m_threads.pop_back();
+        m_runs.pop_back();
         return error;
     }
     return 0;
 }
 
-void DiagnosticRuns::Post(const DiagnosticRequest& request, DiagnosticOutcome outcome) {
+void DiagnosticRuns::Post(const Run& run, const DiagnosticRequest& request,
+                          DiagnosticOutcome outcome) {
     std::lock_guard<std::mutex> lock(m_postedLock);
-    m_posted.push_back(std::make_unique<DiagnosticOutcome>(std::move(outcome)));
-    const auto wParam = reinterpret_cast<platform::WPARAM>(m_posted.back().get());
+    m_posted.push_back(Posted{std::make_unique<DiagnosticOutcome>(std::move(outcome)), run.id});
+    const auto wParam = reinterpret_cast<platform::WPARAM>(m_posted.back().outcome.get());
     if (!platform::PostMessage(request.m_window, request.m_message, wParam, 0)) {
         m_posted.pop_back();  // the window is gone: nobody will take it
     }
 }
 
 std::unique_ptr<DiagnosticOutcome> DiagnosticRuns::TakePosted(platform::WPARAM wParam) {
-    std::unique_ptr<DiagnosticOutcome> taken;
+    Posted taken{};
     {
         std::lock_guard<std::mutex> lock(m_postedLock);
         for (auto it = m_posted.begin(); it != m_posted.end(); ++it) {
-            if (reinterpret_cast<platform::WPARAM>(it->get()) == wParam) {
+            if (reinterpret_cast<platform::WPARAM>(it->outcome.get()) == wParam) {
                 taken = std::move(*it);
                 m_posted.erase(it);
                 break;
             }
         }
     }
+    // The run that posted has nothing left to do: join it now, so that its thread and
+    // descriptors are gone before its event is fired.
+    m_runs.remove_if([&](const Run& run) { return run.id == taken.runId; });
     JoinFinished();
-    return taken;
+    return std::move(taken.outcome);
 }
 
 void DiagnosticRuns::StopAll() {
-    for (platform::Thread& thread : m_threads) {
-        thread.RequestStop();
+    for (Run& run : m_runs) {
+        run.thread.RequestStop();
     }
-    for (platform::Thread& thread : m_threads) {
-        thread.Join();
-    }
-    m_threads.clear();
+    m_runs.clear();  // each thread is joined as its run goes
 }
 
 size_t DiagnosticRuns::Active() {
     JoinFinished();
-    return m_threads.size();
+    return m_runs.size();
 }
 
 void DiagnosticRuns::JoinFinished() {
-    m_threads.remove_if([](platform::Thread& thread) {
-        if (!thread.HasFinished()) {
-            return false;
-        }
-        thread.Join();
-        return true;
-    });
+    // A run that is done has posted (or given up) and only returns: joining it is immediate, so
+    // its descriptors are gone by the time its outcome is handled.
+    m_runs.remove_if([](const Run& run) { return run.done.load(); });
 }
 
 }  // namespace diagnostics

@@ -3,6 +3,7 @@
 // to the window that asked. DiagnosticRuns owns the threads of one window's runs.
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <list>
 #include <memory>
@@ -69,12 +70,25 @@ class DiagnosticRuns {
     size_t Active();
 
   private:
-    void Post(const DiagnosticRequest& request, DiagnosticOutcome outcome);
+    struct Run {
+        // A serial number, not the address: a joined run's node may be reused by the next.
+        uint64_t id = 0;
+        std::atomic<bool> done{false};  // nothing left for the thread but to return
+        platform::Thread thread;        // last: joined before the flag it sets goes
+    };
+
+    struct Posted {
+        std::unique_ptr<DiagnosticOutcome> outcome;
+        uint64_t runId = 0;
+    };
+
+    void Post(const Run& run, const DiagnosticRequest& request, DiagnosticOutcome outcome);
     void JoinFinished();
 
-    std::list<platform::Thread> m_threads;
+    std::list<Run> m_runs;
+    uint64_t m_nextRunId = 1;
     std::mutex m_postedLock;
-    std::vector<std::unique_ptr<DiagnosticOutcome>> m_posted;  // posted and not yet taken
+    std::vector<Posted> m_posted;  // posted and not yet taken
 };
 
 }  // namespace diagnostics

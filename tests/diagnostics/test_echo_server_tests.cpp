@@ -23,6 +23,17 @@ DiagnosticResult RunAgainst(const EchoServer& server, const std::string& name = 
     return result;
 }
 
+// 34 or 38, where the cut of a hostile stream decides which.
+constexpr int32_t kReportFault = -1;
+
+void ExpectCode(int32_t got, int32_t expected) {
+    if (expected == kReportFault) {
+        EXPECT_TRUE(got == 34 || got == 38) << got;
+    } else {
+        EXPECT_EQ(got, expected);
+    }
+}
+
 EchoServer::Options With(Fault fault, int datagram = -1) {
     EchoServer::Options o;
     o.fault = fault;
@@ -67,7 +78,10 @@ TEST(EchoServerTests, CleanRunAndEachFaultEndWithTheirCodeAndTestType) {
          38},
         {"failed register", With(Fault::kNoReport, 0), 0, PMNTT_TEST_ECHO_MEDIA_LARGE_PACKET, 33},
         {"media echo cut", With(Fault::kCutEcho, 5), 35, PMNTT_TEST_ECHO_MEDIA_LARGE_PACKET, 0},
-        {"5000-byte session id", hugeId, 38, PMNTT_TEST_ECHO_SIP_INVITE_RESPONSE, 38},
+        // The login reply's tail and the too-long reports run into the next reads: malformed
+        // or the wrong size, depending on how the stream was cut.
+        {"5000-byte session id", hugeId, kReportFault, PMNTT_TEST_ECHO_SIP_INVITE_RESPONSE,
+         kReportFault},
         {"no Status", Without("Status"), 17, PMNTT_TEST_ECHO, 1},
         {"status 404", status404, 18, PMNTT_TEST_ECHO, 1},
         {"no Session-Id", Without("Session-Id"), 19, PMNTT_TEST_ECHO, 1},
@@ -85,10 +99,10 @@ TEST(EchoServerTests, CleanRunAndEachFaultEndWithTheirCodeAndTestType) {
         ASSERT_TRUE(server.Start());
         const int descriptors = platform::CountOpenDescriptors();
         const DiagnosticResult result = RunAgainst(server);
-        EXPECT_EQ(result.m_errorCode, c.code);
+        ExpectCode(result.m_errorCode, c.code);
         EXPECT_EQ(result.m_testType, c.type);
-        EXPECT_EQ(result.m_tests.at(PMNTT_TEST_ECHO_SIP_REGISTER_REQUEST).m_errorCode,
-                  c.registerCode);
+        ExpectCode(result.m_tests.at(PMNTT_TEST_ECHO_SIP_REGISTER_REQUEST).m_errorCode,
+                   c.registerCode);
         if (c.type == PMNTT_TEST_ECHO) {
             // The header checks name nothing; the wait for the reply names the server.
             EXPECT_EQ(result.m_additionalInfo,

@@ -4,6 +4,7 @@
 #include <poll.h>
 #include <sys/socket.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstring>
 
@@ -88,8 +89,24 @@ void EchoServer::Run() {
         for (auto& c : connections_) {
             fds.push_back({c.socket.Get(), POLLIN, 0});
         }
-        if (poll(fds.data(), fds.size(), -1) < 0) {
+        // Slow logins are answered from here, so the server goes on serving meanwhile.
+        int wait = -1;
+        const uint64_t now = platform::GetTickCount64();
+        for (auto& c : connections_) {
+            if (c.replyAtMs != 0) {
+                const int left = c.replyAtMs > now ? static_cast<int>(c.replyAtMs - now) : 0;
+                wait = wait < 0 ? left : std::min(wait, left);
+            }
+        }
+        if (poll(fds.data(), fds.size(), wait) < 0) {
             continue;
+        }
+        for (auto& c : connections_) {
+            if (c.replyAtMs != 0 && c.replyAtMs <= platform::GetTickCount64() &&
+                c.socket.IsValid()) {
+                c.replyAtMs = 0;
+                SendLoginReply(c);
+            }
         }
         if (fds[0].revents != 0) {
             return;
@@ -142,10 +159,14 @@ void EchoServer::OnControlData(Connection& c) {
     std::snprintf(number, sizeof number, "%02d", logins_);
     c.sessionId =
         options_.sessionId.empty() ? " nq-session-" + std::string(number) : options_.sessionId;
-    if (options_.loginDelayMs > 0 &&
-        platform::Sleep(options_.loginDelayMs) != platform::WaitResult::Timeout) {
+    if (options_.loginDelayMs > 0) {
+        c.replyAtMs = platform::GetTickCount64() + static_cast<uint64_t>(options_.loginDelayMs);
         return;
     }
+    SendLoginReply(c);
+}
+
+void EchoServer::SendLoginReply(Connection& c) {
     std::string reply;
     auto add = [&](const std::string& name, const std::string& value) {
         if (name != options_.missingHeader) {

@@ -65,10 +65,12 @@ class EchoServer {
         std::string received;
         std::string sessionId;
         bool loggedIn = false;
+        uint64_t replyAtMs = 0;  // a login reply still to send at that time (0: none)
     };
 
     void Run();
     void OnControlData(Connection& c);
+    void SendLoginReply(Connection& c);
     void OnDatagram(platform::SocketHandle s);
     void Report(platform::SocketHandle control, const std::string& payload, bool faulty);
     platform::SocketHandle ControlFor(const std::string& payload);

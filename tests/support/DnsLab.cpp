@@ -14,7 +14,9 @@ namespace {
 constexpr const char* kInsideVariable = "NQPM_INSIDE_DNS_LAB";
 }
 
-DnsLab::DnsLab() : name_("nqdns" + std::to_string(platform::testing::CurrentProcessId())) {}
+DnsLab::DnsLab(std::vector<std::string> hostRecords)
+    : name_("nqdns" + std::to_string(platform::testing::CurrentProcessId())),
+      hostRecords_(std::move(hostRecords)) {}
 
 DnsLab::~DnsLab() {
     dnsmasq_.Stop();
@@ -46,12 +48,24 @@ bool DnsLab::Up(std::string* why) {
     std::filesystem::create_directories("/etc/netns/" + name_);
     std::ofstream("/etc/netns/" + name_ + "/resolv.conf") << "nameserver 127.0.0.1\n";
     const std::string log = "/tmp/" + name_ + "-dnsmasq.log";
-    if (!dnsmasq_.Start(
-            {"ip", "netns", "exec", name_, "dnsmasq", "--keep-in-foreground", "--no-resolv",
-             "--no-hosts", "--bind-interfaces", "--listen-address=127.0.0.1", "--local=/lab.test/",
-             std::string("--host-record=") + kKnownName + ",127.0.0.1",
-             "--pid-file=", "--user=root"},
-            log)) {
+    std::vector<std::string> command = {"ip",
+                                        "netns",
+                                        "exec",
+                                        name_,
+                                        "dnsmasq",
+                                        "--keep-in-foreground",
+                                        "--no-resolv",
+                                        "--no-hosts",
+                                        "--bind-interfaces",
+                                        "--listen-address=127.0.0.1",
+                                        "--local=/lab.test/",
+                                        std::string("--host-record=") + kKnownName + ",127.0.0.1",
+                                        "--pid-file=",
+                                        "--user=root"};
+    for (const std::string& record : hostRecords_) {
+        command.push_back("--host-record=" + record);
+    }
+    if (!dnsmasq_.Start(command, log)) {
         *why = "dnsmasq did not start";
         return false;
     }

@@ -5,6 +5,7 @@
 #pragma once
 
 #include <string>
+#include <vector>
 
 #include "tests/support/os/process.h"
 
@@ -15,7 +16,8 @@ class DnsLab {
     static constexpr const char* kKnownName = "stun.lab.test";  // resolves to 127.0.0.1
     static constexpr const char* kUnknownName = "no-such-host.lab.test";
 
-    DnsLab();
+    // hostRecords: further "NAME,ADDRESS" entries the name server knows.
+    explicit DnsLab(std::vector<std::string> hostRecords = {});
     ~DnsLab();
     DnsLab(const DnsLab&) = delete;
     DnsLab& operator=(const DnsLab&) = delete;
@@ -30,6 +32,7 @@ class DnsLab {
 
   private:
     std::string name_;
+    std::vector<std::string> hostRecords_;
     platform::testing::Process dnsmasq_;
     bool created_ = false;
 };

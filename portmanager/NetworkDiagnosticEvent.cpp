@@ -1,5 +1,6 @@
 #include "portmanager/NetworkDiagnosticEvent.h"
 
+#include <iterator>
 #include <new>
 
 #include "portmanager/BstrOut.h"
@@ -27,6 +28,11 @@ HRESULT NetworkDiagnosticEvent::QueryInterface(REFIID riid, void** ppv) {
     }
     if (riid == IID_IUnknown || riid == IID_IDispatch || riid == IID_INetworkDiagnosticEvent) {
         *ppv = static_cast<INetworkDiagnosticEvent*>(this);
+        AddRef();
+        return S_OK;
+    }
+    if (riid == IID_INetworkDiagnosticTests) {
+        *ppv = static_cast<INetworkDiagnosticTests*>(this);
         AddRef();
         return S_OK;
     }
@@ -79,6 +85,32 @@ HRESULT NetworkDiagnosticEvent::get_cookie(LONG* pVal) {
         return E_POINTER;
     }
     *pVal = m_cookie;
+    return S_OK;
+}
+
+HRESULT NetworkDiagnosticEvent::get_TestCount(LONG* pVal) {
+    if (pVal == nullptr) {
+        return E_POINTER;
+    }
+    *pVal = static_cast<LONG>(m_result.m_tests.size());
+    return S_OK;
+}
+
+HRESULT NetworkDiagnosticEvent::GetTest(LONG index, PM_DIAGNOSTIC_TEST_TYPE* type,
+                                        PM_DIAGNOSTIC_RESULT* errorCode, BSTR* additionalInfo) {
+    if (type == nullptr || errorCode == nullptr || additionalInfo == nullptr) {
+        return E_POINTER;
+    }
+    if (index < 0 || static_cast<size_t>(index) >= m_result.m_tests.size()) {
+        return E_INVALIDARG;
+    }
+    const auto& record = std::next(m_result.m_tests.begin(), index)->second;
+    const HRESULT hr = CopyBstrOut(record.m_additionalInfo, additionalInfo);
+    if (FAILED(hr)) {
+        return hr;
+    }
+    *type = static_cast<PM_DIAGNOSTIC_TEST_TYPE>(record.m_testType);
+    *errorCode = static_cast<PM_DIAGNOSTIC_RESULT>(record.m_errorCode);
     return S_OK;
 }
 

@@ -11,7 +11,8 @@
 
 namespace portmanager {
 
-class NetworkDiagnosticEvent final : public NoTypeInfoDispatch<INetworkDiagnosticEvent> {
+class NetworkDiagnosticEvent final : public NoTypeInfoDispatch<INetworkDiagnosticEvent>,
+                                     public INetworkDiagnosticTests {
   public:
     // A new event holding a copy of result, with one reference held by the caller.
     static HRESULT Create(const diagnostics::DiagnosticResult& result, LONG cookie,
@@ -27,6 +28,10 @@ class NetworkDiagnosticEvent final : public NoTypeInfoDispatch<INetworkDiagnosti
     HRESULT get_TestTypeText(BSTR* pVal) override;
     HRESULT get_AdditionalInfo(BSTR* pVal) override;
     HRESULT get_cookie(LONG* pVal) override;
+
+    HRESULT get_TestCount(LONG* pVal) override;
+    HRESULT GetTest(LONG index, PM_DIAGNOSTIC_TEST_TYPE* type, PM_DIAGNOSTIC_RESULT* errorCode,
+                    BSTR* additionalInfo) override;
 
     const diagnostics::DiagnosticResult& Result() const { return m_result; }
 

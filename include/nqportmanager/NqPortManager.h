@@ -127,6 +127,7 @@ inline constexpr IID DIID__IAdvancedPortManagerEvents =
     MakeGuid("0AFB8C5E-1C4A-4BB9-BF51-7A872822DBDE");
 inline constexpr IID IID_IPortManagerUpdateEvent = MakeGuid("EE9A8A46-776D-4C9F-B7B1-E201B044A9CC");
 inline constexpr IID IID_INetworkDiagnosticEvent = MakeGuid("827A1D3A-73BE-45EE-AC32-A5C5707C4D87");
+inline constexpr IID IID_INetworkDiagnosticTests = MakeGuid("72FE03CD-4526-447C-B47A-B84CD778AA06");
 inline constexpr IID IID_ILocalSipProxy = MakeGuid("B9CF6437-54BC-41D7-9F91-4E4CD48CC0DF");
 // The port-mapping interface answers under two ids that share one implementation.
 inline constexpr IID IID_IPortMappingProvider = MakeGuid("24C284AB-8AEC-462A-B740-0756B3A33D5B");
@@ -223,6 +224,15 @@ struct INetworkDiagnosticEvent : public IDispatch {
     virtual HRESULT get_cookie(LONG* pVal) = 0;
 };
 
+// Every test of a diagnostic run, not only the last: query it from the INetworkDiagnosticEvent
+// (this platform's addition; the interface above stays as clients know it).
+struct INetworkDiagnosticTests : public IUnknown {
+    virtual HRESULT get_TestCount(LONG* pVal) = 0;
+    // Tests in the order of their type; E_INVALIDARG for an index outside 0..count-1.
+    virtual HRESULT GetTest(LONG index, PM_DIAGNOSTIC_TEST_TYPE* type,
+                            PM_DIAGNOSTIC_RESULT* errorCode, BSTR* additionalInfo) = 0;
+};
+
 // Port mappings of the port manager (query it from IAdvancedPortManager).
 struct IPortMappingProvider : public IUnknown {
     // type: a PortMappingType. Returned BSTRs belong to the caller.
@@ -246,3 +256,4 @@ NQ_DECLARE_COM_IID(_IAdvancedPortManagerEvents, DIID__IAdvancedPortManagerEvents
 NQ_DECLARE_COM_IID(IPortManagerUpdateEvent, IID_IPortManagerUpdateEvent);
 NQ_DECLARE_COM_IID(IPortMappingProvider, IID_IPortMappingProvider);
 NQ_DECLARE_COM_IID(INetworkDiagnosticEvent, IID_INetworkDiagnosticEvent);
+NQ_DECLARE_COM_IID(INetworkDiagnosticTests, IID_INetworkDiagnosticTests);

@@ -1,6 +1,6 @@
 #include <gtest/gtest.h>
 
-#include <regex>
+#include <cctype>
 
 #include "diagnostics/EchoProtocol.h"
 #include "diagnostics/EchoServerTests.h"
@@ -21,6 +21,25 @@ DiagnosticResult RunAgainst(const EchoServer& server, const std::string& name = 
     diagnostics::RunEchoServerTests(platform::HostToNet32(kLoopback), name, server.Port(),
                                     kTimeoutMs, result);
     return result;
+}
+
+// "(127.0.0.1:P,127.0.0.1:Q)" with decimal ports.
+bool IsTwoLoopbackEndpoints(const std::string& text) {
+    size_t at = 0;
+    auto take = [&](std::string_view part) {
+        const bool ok = text.compare(at, part.size(), part) == 0;
+        at += part.size();
+        return ok;
+    };
+    auto digits = [&] {
+        const size_t start = at;
+        while (at < text.size() && std::isdigit(static_cast<unsigned char>(text[at]))) {
+            ++at;
+        }
+        return at > start;
+    };
+    return take("(127.0.0.1:") && digits() && take(",127.0.0.1:") && digits() && take(")") &&
+           at == text.size();
 }
 
 // 34 or 38, where the cut of a hostile stream decides which.
@@ -92,7 +111,6 @@ TEST(EchoServerTests, CleanRunAndEachFaultEndWithTheirCodeAndTestType) {
         {"no Video-RTCP-Port", Without("Video-RTCP-Port"), 24, PMNTT_TEST_ECHO, 1},
         {"slow login", slowLogin, 39, PMNTT_TEST_ECHO, 1},
     };
-    const std::regex twoEndpoints(R"(\(127\.0\.0\.1:\d+,127\.0\.0\.1:\d+\))");
     for (const auto& c : cases) {
         SCOPED_TRACE(c.name);
         EchoServer server(c.options);
@@ -109,8 +127,7 @@ TEST(EchoServerTests, CleanRunAndEachFaultEndWithTheirCodeAndTestType) {
                       c.code == 39 ? "(127.0.0.1:" + std::to_string(server.Port()) + ")" : "");
             EXPECT_EQ(result.m_tests.at(PMNTT_TEST_ECHO_MEDIA_LARGE_PACKET).m_errorCode, 1);
         } else {
-            EXPECT_TRUE(std::regex_match(result.m_additionalInfo, twoEndpoints))
-                << result.m_additionalInfo;
+            EXPECT_TRUE(IsTwoLoopbackEndpoints(result.m_additionalInfo)) << result.m_additionalInfo;
             EXPECT_EQ(result.m_tests.count(PMNTT_TEST_ECHO), 0u);
         }
         // Media runs only after a good last SIP exchange.

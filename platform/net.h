@@ -78,6 +78,8 @@ std::string InetNtoaNet(uint32_t netAddress);
 
 // Resolves a host name (no dotted-quad shortcut) to its first IPv4 address, network order.
 // Returns 0 on success, otherwise a socket error (kErrHostNotFound when the name is unknown).
+// Safe when several threads resolve at once. On a thread started by platform::Thread the wait
+// ends early with kErrInterrupted when its owner asks it to stop.
 int ResolveHostNameNet(const std::string& name, uint32_t* netAddress);
 
 // An IPv4 datagram socket; invalid on failure.

@@ -2,8 +2,11 @@
 // namespace the test makes, and name look-ups against a name server of its own.
 #include <gtest/gtest.h>
 
+#include <chrono>
+
 #include "diagnostics/DiagnosticRun.h"
 #include "foundation/NetUtils.h"
+#include "portmanager/AdvancedPortManager.h"
 #include "tests/support/DnsLab.h"
 #include "tests/support/EchoServer.h"
 #include "tests/support/FakeNetworkInfo.h"
@@ -86,9 +89,9 @@ struct GatewayNetwork {
 };
 
 // The outer test builds the lab and runs itself inside it, where the body checks.
-#define NQPM_RUN_INSIDE(suite, name, records)        \
+#define NQPM_RUN_INSIDE(suite, name, ...)            \
     if (!testsupport::DnsLab::InsideDnsLab()) {      \
-        testsupport::DnsLab lab(records);            \
+        testsupport::DnsLab lab(__VA_ARGS__);        \
         std::string why;                             \
         if (!lab.Up(&why)) {                         \
             GTEST_SKIP() << why;                     \
@@ -138,6 +141,29 @@ TEST(LabDiagnoseDns, NoNameResolves) {
     EXPECT_EQ(r.m_testType, PMNTT_TEST_DNS);
     EXPECT_EQ(r.m_additionalInfo,
               std::string("(") + testsupport::DnsLab::kUnknownName + ", a.root-servers.net)");
+}
+
+TEST(LabDiagnoseDns, ShutdownEndsARunWaitingForASilentNameServer) {
+    NQPM_RUN_INSIDE(LabDiagnoseDns, ShutdownEndsARunWaitingForASilentNameServer,
+                    std::vector<std::string>{}, false)
+    // The name server: receives the question and never answers.
+    platform::Socket silent = platform::OpenUdpSocket();
+    ASSERT_TRUE(platform::BindSocket(silent.Get(), 0x7F000001, 53));
+    GatewayNetwork network;
+    portmanager::PortManagerServices services;
+    services.networkInfo = network.services.networkInfo;
+    services.routeLookup = network.services.routeLookup;
+    IAdvancedPortManager* pm = nullptr;
+    ASSERT_EQ(portmanager::CAdvancedPortManager::CreateInstance(
+                  IID_IAdvancedPortManager, reinterpret_cast<void**>(&pm), services),
+              S_OK);
+    BStr wellKnown("192.0.2.1"), stun(testsupport::DnsLab::kKnownName), echo("127.0.0.1");
+    ASSERT_EQ(pm->DiagnoseNetwork(wellKnown.Get(), stun.Get(), echo.Get(), 7000, 1000, 1), S_OK);
+    ASSERT_EQ(platform::WaitSocketReadable(silent.Get(), 5000), 1);  // the run asks and waits
+    const auto start = std::chrono::steady_clock::now();
+    EXPECT_EQ(pm->Shutdown(), S_OK);
+    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(1000));
+    pm->Release();
 }
 
 }  // namespace

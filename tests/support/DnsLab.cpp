@@ -14,9 +14,10 @@ namespace {
 constexpr const char* kInsideVariable = "NQPM_INSIDE_DNS_LAB";
 }
 
-DnsLab::DnsLab(std::vector<std::string> hostRecords)
+DnsLab::DnsLab(std::vector<std::string> hostRecords, bool nameServer)
     : name_("nqdns" + std::to_string(platform::testing::CurrentProcessId())),
-      hostRecords_(std::move(hostRecords)) {}
+      hostRecords_(std::move(hostRecords)),
+      nameServer_(nameServer) {}
 
 DnsLab::~DnsLab() {
     dnsmasq_.Stop();
@@ -34,7 +35,8 @@ bool DnsLab::InsideDnsLab() {
 }
 
 bool DnsLab::Up(std::string* why) {
-    if (!platform::testing::IsRoot() || platform::testing::FindExecutable("dnsmasq").empty()) {
+    if (!platform::testing::IsRoot() ||
+        (nameServer_ && platform::testing::FindExecutable("dnsmasq").empty())) {
         *why = "needs root and dnsmasq";
         return false;
     }
@@ -47,6 +49,9 @@ bool DnsLab::Up(std::string* why) {
     // `ip netns exec` shows this file as /etc/resolv.conf inside the namespace.
     std::filesystem::create_directories("/etc/netns/" + name_);
     std::ofstream("/etc/netns/" + name_ + "/resolv.conf") << "nameserver 127.0.0.1\n";
+    if (!nameServer_) {
+        return true;
+    }
     const std::string log = "/tmp/" + name_ + "-dnsmasq.log";
     std::vector<std::string> command = {"ip",
                                         "netns",

@@ -5,6 +5,7 @@
 #include <chrono>
 #include <deque>
 
+#include "platform/kernel.h"
 #include "platform/message.h"
 #include "platform/net.h"
 #include "portmanager/AdvancedPortManager.h"
@@ -23,8 +24,9 @@ struct FakeRouteLookup : platform::RouteLookup {
         ++asked;
         lastDestination = destinationNet;
         *index = 1;
-        return error;
+        return destinationNet == noRouteTo ? 65 : error;
     }
+    uint32_t noRouteTo = platform::InetAddrNet("198.51.100.1");
     int error = 0;
     std::atomic<int> asked{0};
     std::atomic<uint32_t> lastDestination{0};
@@ -267,7 +269,7 @@ TEST_F(DiagnoseNetworkWithPeers, TwoRunsAtOnceEachReachEverySinkWithTheirOwnCook
     EXPECT_EQ(echo.Datagrams().size(), 16u);
 }
 
-TEST_F(DiagnoseNetworkWithPeers, ReleaseDuringTheEchoLoginReturnsPromptlyAndLeavesNoDescriptor) {
+TEST_F(DiagnoseNetworkWithPeers, ReleaseDuringTheEchoLoginReturnsPromptlyAndLeavesNothing) {
     testsupport::EchoServer::Options slow;
     slow.loginDelayMs = 20000;
     testsupport::EchoServer echo(slow);
@@ -275,6 +277,10 @@ TEST_F(DiagnoseNetworkWithPeers, ReleaseDuringTheEchoLoginReturnsPromptlyAndLeav
     const int descriptors = platform::CountOpenDescriptors();
     ASSERT_EQ(Diagnose("192.0.2.1", stunAddress, "127.0.0.1", echo.Port(), 15000, 1), S_OK);
     ASSERT_TRUE(echo.WaitConnected(10000));
+    // A second run ends at once; its outcome is posted but never handled, and goes with the
+    // port manager (the leak check of the sanitizer build would see it otherwise).
+    ASSERT_EQ(Diagnose("198.51.100.1", stunAddress, "127.0.0.1", echo.Port(), 15000, 2), S_OK);
+    platform::Sleep(200);
     const auto start = std::chrono::steady_clock::now();
     pm->Release();
     pm = nullptr;

@@ -111,7 +111,8 @@ class Thread {
     Thread(const Thread&) = delete;
     Thread& operator=(const Thread&) = delete;
 
-    // False if a thread is already held or the system refused to create one.
+    // False if a thread is already held or the system refused to create one (errno then says
+    // why).
     bool Start(std::function<void()> body);
     void RequestStop();
     void Join();

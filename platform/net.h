@@ -61,6 +61,7 @@ inline constexpr int kErrNoRecovery = 11003;    // WSANO_RECOVERY
 inline constexpr int kErrNoData = 11004;        // WSANO_DATA
 inline constexpr int kErrMessageSize = 10040;   // WSAEMSGSIZE: datagram longer than the buffer
 inline constexpr int kErrInterrupted = 10004;   // WSAEINTR: the owner asked the thread to stop
+inline constexpr int kErrTimedOut = 10060;      // WSAETIMEDOUT: a connect did not finish in time
 
 int LastSocketError();
 
@@ -77,6 +78,8 @@ std::string InetNtoaNet(uint32_t netAddress);
 
 // Resolves a host name (no dotted-quad shortcut) to its first IPv4 address, network order.
 // Returns 0 on success, otherwise a socket error (kErrHostNotFound when the name is unknown).
+// Safe when several threads resolve at once. On a thread started by platform::Thread the wait
+// ends early with kErrInterrupted when its owner asks it to stop.
 int ResolveHostNameNet(const std::string& name, uint32_t* netAddress);
 
 // An IPv4 datagram socket; invalid on failure.
@@ -99,6 +102,18 @@ int WaitSocketReadable(SocketHandle s, int timeoutMs);
 // reported as kSocketError with kErrMessageSize, as Windows does.
 int ReceiveFrom(SocketHandle s, void* buffer, size_t capacity, uint32_t* fromHostAddress,
                 uint16_t* fromPort);
+
+// Connects a stream socket, waiting at most timeoutMs (-1: the system's own limit). 0 on
+// success, otherwise kSocketError with LastSocketError() the reason (kErrTimedOut,
+// kErrInterrupted when the calling thread's owner asked it to stop).
+int ConnectSocket(SocketHandle s, uint32_t hostAddress, uint16_t port, int timeoutMs);
+
+// send on a connected socket: bytes sent or kSocketError.
+int Send(SocketHandle s, const void* data, size_t length);
+
+// One recv: byte count (0 when a stream's peer closed), or kSocketError. A datagram longer than
+// the capacity is reported as kSocketError with kErrMessageSize, as Windows does.
+int Receive(SocketHandle s, void* buffer, size_t capacity);
 
 // Counts the descriptors this process has open (a leak check for tests and diagnostics).
 int CountOpenDescriptors();

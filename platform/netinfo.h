@@ -35,4 +35,16 @@ class NetworkInfo {
 // The system's answers; the default wherever a NetworkInfo is taken.
 NetworkInfo& SystemNetworkInfo();
 
+// The interface the system would send through toward a destination (GetBestInterface). Asking
+// sends nothing.
+class RouteLookup {
+  public:
+    virtual ~RouteLookup() = default;
+    // 0 and the interface index, or the system's error (no route, say).
+    virtual int BestInterface(uint32_t destinationNet, uint32_t* interfaceIndex) = 0;
+};
+
+// The kernel's route look-up.
+RouteLookup& SystemRouteLookup();
+
 }  // namespace platform

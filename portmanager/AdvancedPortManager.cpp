@@ -72,7 +72,8 @@ HRESULT CAdvancedPortManager::FinalConstruct() {
 }
 
 void CAdvancedPortManager::FinalRelease() {
-    // The monitor's thread posts to the window: stop it before the window goes.
+    // The monitor's and the diagnostic threads post to the window: stop them before it goes.
+    m_diagnosticRuns.StopAll();
     m_monitor.Stop();
     m_monitor.Unsubscribe(this);
     if (m_refreshTimerId != 0) {
@@ -282,6 +283,7 @@ HRESULT CAdvancedPortManager::InitializeEx2(BSTR bstrStunServerName, LONG lStart
 
 HRESULT CAdvancedPortManager::Shutdown() {
     NQ_TRACE_ENTERED("CAdvancedPortManager::Shutdown");
+    m_diagnosticRuns.StopAll();
     m_monitor.Stop();
     m_monitor.Unsubscribe(this);
     if (m_pStunResult) {
@@ -362,11 +364,6 @@ HRESULT CAdvancedPortManager::ErrorCanBeDiagnosed(LONG errorCode, VARIANT_BOOL* 
                              (code >= kFirstDiagnosableRange && code <= kLastDiagnosableRange);
     *pVal = diagnosable ? VARIANT_TRUE : VARIANT_FALSE;
     return S_OK;
-}
-
-HRESULT CAdvancedPortManager::DiagnoseNetwork(BSTR, BSTR, BSTR, INT, LONG, LONG) {
-    NQ_TRACE_ENTERED("CAdvancedPortManager::DiagnoseNetwork");
-    return E_NOTIMPL;
 }
 
 // INqDiagnostics: one logger for the whole process.

@@ -12,6 +12,7 @@
 
 #include <nqportmanager/NqPortManager.h>
 
+#include "diagnostics/DiagnosticRun.h"
 #include "foundation/NetworkChangeMonitor.h"
 #include "platform/message.h"
 #include "platform/modulelock.h"
@@ -42,6 +43,8 @@ struct PortManagerServices {
     // Addresses, gateways and the UDP counter, for the port manager and its STUN service.
     platform::NetworkInfo* networkInfo = &platform::SystemNetworkInfo();
     platform::UpnpGatewayProbe* upnpProbe = &platform::SystemUpnpGatewayProbe();
+    // The interface toward an address, for the diagnostic runs.
+    platform::RouteLookup* routeLookup = &platform::SystemRouteLookup();
     // Empty: no STUN service. Default() creates the real one.
     std::function<std::unique_ptr<stun::ISTUNResult>(const char* servers, platform::WindowHandle,
                                                      platform::UINT, platform::WPARAM,
@@ -184,6 +187,7 @@ class CAdvancedPortManager final : public ISupportErrorInfo,
     void OnUpnpDetected();
     void OnStunRefresh();
     void NotifyChange(PM_EVENT type);
+    void OnDiagnosticComplete(platform::WPARAM wParam);
     // Discovery
     void StartStunDiscovery();
     // What the answer concludes, applied and told to the sinks (or the STUN pass started).
@@ -227,6 +231,8 @@ class CAdvancedPortManager final : public ISupportErrorInfo,
     ProfileMappings m_profile;
 
     foundation::CNetworkChangeMonitor m_monitor;
+    // Stopped and joined by Shutdown and the final release, before the window goes.
+    diagnostics::DiagnosticRuns m_diagnosticRuns;
 };
 
 }  // namespace portmanager

@@ -24,6 +24,9 @@ platform::LRESULT CAdvancedPortManager::WindowProc(platform::UINT message, platf
         case WM_PM_NETWORK_CHANGE:
             NotifyChange(PME_NETWORK_CHANGE);
             break;
+        case WM_PM_DIAGNOSTIC_COMPLETE:
+            OnDiagnosticComplete(wParam);
+            break;
         default:
             handled = false;
             break;

@@ -40,6 +40,72 @@ enum PM_EVENT : int32_t {
     PME_DIAGNOSTIC_COMPLETED = 3,
 };
 
+// Result codes of a diagnostic run. The numbers are what a run reports; for 2 to 10 the names
+// do not tell the condition (4: no route to the Internet, 3: no gateway, 7 and 8: name
+// resolution, 9 and 10: the UDP port 3478 test). ErrorText of the event gives the meaning.
+enum PM_DIAGNOSTIC_RESULT : int32_t {
+    PMDR_NO_ERROR = 0,
+    PMDR_TEST_NOT_RUN = 1,
+    PMDR_NO_INTERFACE_WITH_GATEWAY = 2,
+    PMDR_NO_INTERFACE_WITH_ROUTE = 3,
+    PMDR_TIMEOUT = 4,
+    PMDR_CANT_ICMP = 5,
+    PMDR_CANT_RESOLVE_NOQUA_UDP_SERVER = 6,
+    PMDR_CANT_RESOLVE_ROOT_DNS_SERVER = 7,
+    PMDR_CANT_CONVERT_LOCAL_IP_ADDRESS = 8,
+    PMDR_CANT_CONTACT_STUN_SERVER_ON_UDP_PORT_3478 = 9,
+    PMDR_CANT_RESOLVE_NOQUA_TCP_SERVER = 10,
+    PMDR_CANT_CREATE_TCP_SOCKET = 11,
+    PMDR_CANT_LOAD_ICMP_LIBRARY = 12,
+    PMDR_CANT_FIND_SENDECHO2_PROCADDR = 13,
+    PMDR_CANT_CONNECT_TO_ECHO_SERVER = 14,
+    PMDR_ECHO_SERVER_LOGIN_SEND_FAILED = 15,
+    PMDR_ECHO_SERVER_LOGIN_RECV_FAILED = 16,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_MISSING_STATUS = 17,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_FAILED_STATUS = 18,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_MISSING_SESSIONID = 19,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_MISSING_SIPPORT = 20,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_MISSING_AUDIORTP = 21,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_MISSING_AUDIORTCP = 22,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_MISSING_VIDEORTP = 23,
+    PMDR_ECHO_SERVER_LOGIN_RESPONSE_MISSING_VIDEORTCP = 24,
+    PMDR_ECHO_SERVER_CANT_ALLOCATE_SIP_SOCKET = 25,
+    PMDR_ECHO_SERVER_CANT_ALLOCATE_MEDIA_SOCKET = 26,
+    PMDR_ECHO_SERVER_SIP_UDP_SEND_FAILED = 27,
+    PMDR_ECHO_SERVER_SIP_UDP_RECV_FAILED = 28,
+    PMDR_ECHO_SERVER_SIP_TCP_SEND_FAILED = 29,
+    PMDR_ECHO_SERVER_SIP_TCP_RECV_FAILED = 30,
+    PMDR_ECHO_SERVER_SIP_NO_UDP_OR_TCP = 31,
+    PMDR_ECHO_SERVER_SIP_NO_UDP = 32,
+    PMDR_ECHO_SERVER_SIP_NO_TCP = 33,
+    PMDR_ECHO_SERVER_SIP_MALFORMED_TCP_PACKET = 34,
+    PMDR_ECHO_SERVER_SIP_UDP_DIFFERENT_LENGTH = 35,
+    PMDR_ECHO_SERVER_SIP_UDP_DATA_DIFFERENT = 36,
+    PMDR_ECHO_SERVER_SIP_TCP_PACKETS_DIFFERENT = 37,
+    PMDR_ECHO_SERVER_SIP_TCP_PACKETS_DIFFERENT_SIZE = 38,
+    PMDR_ECHO_SERVER_LOGIN_RECV_FAILED_TIMEOUT = 39,
+    PMDR_ECHO_SERVER_TCP_SET_ASYNC_FAILED = 40,
+    PMDR_ECHO_SERVER_UDP_SET_ASYNC_FAILED = 41,
+    PMDR_ECHO_SERVER_CANT_RESOLVE_NAME = 42,
+    PMDR_ECHO_SERVER_LAST_ERROR = 43,
+};
+
+// The tests of a diagnostic run.
+enum PM_DIAGNOSTIC_TEST_TYPE : int32_t {
+    PMNTT_TEST_LOCATE_INTERFACE = 0,
+    PMNTT_TEST_PING_GATEWAY = 1,  // not run: its entry stays PMDR_TEST_NOT_RUN
+    PMNTT_TEST_DNS = 2,
+    PMNTT_TEST_STUN = 3,
+    PMNTT_TEST_ECHO = 4,
+    PMNTT_TEST_ECHO_SIP = 5,
+    PMNTT_TEST_ECHO_SIP_INVITE_REQUEST = 6,
+    PMNTT_TEST_ECHO_SIP_INVITE_RESPONSE = 7,
+    PMNTT_TEST_ECHO_SIP_REGISTER_REQUEST = 8,
+    PMNTT_TEST_ECHO_SIP_REGISTER_RESPONSE = 9,
+    PMNTT_TEST_ECHO_MEDIA = 10,
+    PMNTT_TEST_ECHO_MEDIA_LARGE_PACKET = 11,
+};
+
 // The type argument of IPortMappingProvider::GetMapping.
 enum PortMappingType : int32_t {
     AudioRTP = 0,
@@ -62,6 +128,7 @@ inline constexpr IID DIID__IAdvancedPortManagerEvents =
     MakeGuid("0AFB8C5E-1C4A-4BB9-BF51-7A872822DBDE");
 inline constexpr IID IID_IPortManagerUpdateEvent = MakeGuid("EE9A8A46-776D-4C9F-B7B1-E201B044A9CC");
 inline constexpr IID IID_INetworkDiagnosticEvent = MakeGuid("827A1D3A-73BE-45EE-AC32-A5C5707C4D87");
+inline constexpr IID IID_INetworkDiagnosticTests = MakeGuid("72FE03CD-4526-447C-B47A-B84CD778AA06");
 inline constexpr IID IID_ILocalSipProxy = MakeGuid("B9CF6437-54BC-41D7-9F91-4E4CD48CC0DF");
 // The port-mapping interface answers under two ids that share one implementation.
 inline constexpr IID IID_IPortMappingProvider = MakeGuid("24C284AB-8AEC-462A-B740-0756B3A33D5B");
@@ -103,6 +170,16 @@ struct IAdvancedPortManager : public IDispatch {
     // networkAddresses: a VARIANT of type VT_ARRAY | VT_BSTR, one "address[:port]" per element.
     virtual HRESULT OnBeforeEnableProfileEx(VARIANT networkAddresses, LONG minPort, LONG maxPort,
                                             LONG portsPerProtocol, VARIANT_BOOL randomizePorts) = 0;
+    // Starts a diagnostic run on a thread of its own and returns at once; its outcome arrives as
+    // PME_DIAGNOSTIC_COMPLETED with an INetworkDiagnosticEvent carrying the cookie. The run
+    // locates the interface toward the well-known address (a dotted quad), checks its gateway,
+    // resolves the STUN server, asks it on UDP port 3478, then logs in to the echo server
+    // (host[:port given apart]) and checks SIP and media echoes; timeout (ms) bounds every wait.
+    // E_POINTER for a null string, E_INVALIDARG for a port outside 1..65534 or a negative
+    // timeout. Several runs may go on at once; Shutdown and the final release stop and wait for
+    // them (a stopped run fires nothing).
+    // The media echo sends 1398 bytes starting with "Call-ID: <session id>\r\n"; a session id
+    // too long for that line is cut so that the payload stays 1398 bytes.
     virtual HRESULT DiagnoseNetwork(BSTR bstrWellKnownNetworkAddress, BSTR bstrStunServer,
                                     BSTR bstrEchoServer, INT nEchoServerPort, LONG timeout,
                                     LONG cookie) = 0;
@@ -136,6 +213,27 @@ struct IPortManagerUpdateEvent : public IDispatch {
     virtual HRESULT put_PortManager(IAdvancedPortManager* newVal) = 0;
 };
 
+// Travels with PME_DIAGNOSTIC_COMPLETED: the test recorded last (the failing one, or the last
+// test of a clean run) and the cookie given to DiagnoseNetwork. Every getter gives E_POINTER
+// for a null out argument; returned BSTRs belong to the caller.
+struct INetworkDiagnosticEvent : public IDispatch {
+    virtual HRESULT get_errorCode(PM_DIAGNOSTIC_RESULT* pVal) = 0;
+    virtual HRESULT get_ErrorText(BSTR* pVal) = 0;
+    virtual HRESULT get_TestType(PM_DIAGNOSTIC_TEST_TYPE* pVal) = 0;
+    virtual HRESULT get_TestTypeText(BSTR* pVal) = 0;
+    virtual HRESULT get_AdditionalInfo(BSTR* pVal) = 0;
+    virtual HRESULT get_cookie(LONG* pVal) = 0;
+};
+
+// Every test of a diagnostic run, not only the last: query it from the INetworkDiagnosticEvent
+// (this platform's addition; the interface above stays as clients know it).
+struct INetworkDiagnosticTests : public IUnknown {
+    virtual HRESULT get_TestCount(LONG* pVal) = 0;
+    // Tests in the order of their type; E_INVALIDARG for an index outside 0..count-1.
+    virtual HRESULT GetTest(LONG index, PM_DIAGNOSTIC_TEST_TYPE* type,
+                            PM_DIAGNOSTIC_RESULT* errorCode, BSTR* additionalInfo) = 0;
+};
+
 // Port mappings of the port manager (query it from IAdvancedPortManager).
 struct IPortMappingProvider : public IUnknown {
     // type: a PortMappingType. Returned BSTRs belong to the caller.
@@ -158,6 +256,8 @@ NQ_DECLARE_COM_IID(INqDiagnostics, IID_INqDiagnostics);
 NQ_DECLARE_COM_IID(_IAdvancedPortManagerEvents, DIID__IAdvancedPortManagerEvents);
 NQ_DECLARE_COM_IID(IPortManagerUpdateEvent, IID_IPortManagerUpdateEvent);
 NQ_DECLARE_COM_IID(IPortMappingProvider, IID_IPortMappingProvider);
+NQ_DECLARE_COM_IID(INetworkDiagnosticEvent, IID_INetworkDiagnosticEvent);
+NQ_DECLARE_COM_IID(INetworkDiagnosticTests, IID_INetworkDiagnosticTests);
 
 // The module's entry points, as a COM in-process server exports them (libNqPortManager.so).
 extern "C" {

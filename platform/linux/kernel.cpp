@@ -213,7 +213,8 @@ bool Thread::Start(std::function<void()> body) {
             t_stop = nullptr;
             state->finished.store(true);
         });
-    } catch (const std::system_error&) {
+    } catch (const std::system_error& e) {
+        errno = e.code().value();  // for callers that report the system's reason
         return false;
     }
     state_ = std::move(state);

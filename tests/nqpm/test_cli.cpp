@@ -113,6 +113,10 @@ TEST(NqpmExit, BadUsageGivesTwoAndOneLineNamingTheCommand) {
         {"discover", "--stun", "x", "--timeout", "soon"},
         {"profile", "--stun", "x", "--no-upnp"},
         {"monitor", "--bogus"},
+        {"diagnose", "--stun", "s", "--echo", "e"},
+        {"diagnose", "--well-known", "host.example", "--stun", "s", "--echo", "e"},
+        {"diagnose", "--well-known", "192.0.2.1", "--stun", "s", "--echo", "e:0"},
+        {"diagnose", "--well-known", "192.0.2.1", "--stun", "s", "--echo", "e", "--timeout", "-1"},
     };
     for (const auto& args : kBad) {
         const NqpmRun r = RunNqpm(args);

@@ -14,7 +14,10 @@ namespace {
 constexpr const char* kInsideVariable = "NQPM_INSIDE_DNS_LAB";
 }
 
-DnsLab::DnsLab() : name_("nqdns" + std::to_string(platform::testing::CurrentProcessId())) {}
+DnsLab::DnsLab(std::vector<std::string> hostRecords, bool nameServer)
+    : name_("nqdns" + std::to_string(platform::testing::CurrentProcessId())),
+      hostRecords_(std::move(hostRecords)),
+      nameServer_(nameServer) {}
 
 DnsLab::~DnsLab() {
     dnsmasq_.Stop();
@@ -32,7 +35,8 @@ bool DnsLab::InsideDnsLab() {
 }
 
 bool DnsLab::Up(std::string* why) {
-    if (!platform::testing::IsRoot() || platform::testing::FindExecutable("dnsmasq").empty()) {
+    if (!platform::testing::IsRoot() ||
+        (nameServer_ && platform::testing::FindExecutable("dnsmasq").empty())) {
         *why = "needs root and dnsmasq";
         return false;
     }
@@ -45,13 +49,28 @@ bool DnsLab::Up(std::string* why) {
     // `ip netns exec` shows this file as /etc/resolv.conf inside the namespace.
     std::filesystem::create_directories("/etc/netns/" + name_);
     std::ofstream("/etc/netns/" + name_ + "/resolv.conf") << "nameserver 127.0.0.1\n";
+    if (!nameServer_) {
+        return true;
+    }
     const std::string log = "/tmp/" + name_ + "-dnsmasq.log";
-    if (!dnsmasq_.Start(
-            {"ip", "netns", "exec", name_, "dnsmasq", "--keep-in-foreground", "--no-resolv",
-             "--no-hosts", "--bind-interfaces", "--listen-address=127.0.0.1", "--local=/lab.test/",
-             std::string("--host-record=") + kKnownName + ",127.0.0.1",
-             "--pid-file=", "--user=root"},
-            log)) {
+    std::vector<std::string> command = {"ip",
+                                        "netns",
+                                        "exec",
+                                        name_,
+                                        "dnsmasq",
+                                        "--keep-in-foreground",
+                                        "--no-resolv",
+                                        "--no-hosts",
+                                        "--bind-interfaces",
+                                        "--listen-address=127.0.0.1",
+                                        "--local=/lab.test/",
+                                        std::string("--host-record=") + kKnownName + ",127.0.0.1",
+                                        "--pid-file=",
+                                        "--user=root"};
+    for (const std::string& record : hostRecords_) {
+        command.push_back("--host-record=" + record);
+    }
+    if (!dnsmasq_.Start(command, log)) {
         *why = "dnsmasq did not start";
         return false;
     }

@@ -5,6 +5,7 @@
 #pragma once
 
 #include <string>
+#include <vector>
 
 #include "tests/support/os/process.h"
 
@@ -15,7 +16,9 @@ class DnsLab {
     static constexpr const char* kKnownName = "stun.lab.test";  // resolves to 127.0.0.1
     static constexpr const char* kUnknownName = "no-such-host.lab.test";
 
-    DnsLab();
+    // hostRecords: further "NAME,ADDRESS" entries the name server knows. Without a name server
+    // the namespace still names 127.0.0.1 as one, for a test to play it (or leave it silent).
+    explicit DnsLab(std::vector<std::string> hostRecords = {}, bool nameServer = true);
     ~DnsLab();
     DnsLab(const DnsLab&) = delete;
     DnsLab& operator=(const DnsLab&) = delete;
@@ -30,6 +33,8 @@ class DnsLab {
 
   private:
     std::string name_;
+    std::vector<std::string> hostRecords_;
+    bool nameServer_;
     platform::testing::Process dnsmasq_;
     bool created_ = false;
 };

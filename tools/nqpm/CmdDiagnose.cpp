@@ -3,9 +3,9 @@
 
 #include "diagnostics/DiagnosticResult.h"
 #include "platform/message.h"
-#include "portmanager/AdvancedPortManager.h"
 #include "tools/nqpm/Cli.h"
 #include "tools/nqpm/Commands.h"
+#include "tools/nqpm/ModuleClient.h"
 
 namespace nqpm {
 
@@ -112,9 +112,10 @@ Json OutcomeJson(const Outcome& o, const std::vector<std::pair<std::string, std:
 }  // namespace
 
 int RunDiagnose(int argc, char** argv) {
-    Options options("diagnose",
-                    {{"well-known", true}, {"stun", true}, {"echo", true}, {"timeout", true}},
-                    kUsage);
+    Options options(
+        "diagnose",
+        {{"well-known", true}, {"stun", true}, {"echo", true}, {"timeout", true}, {"module", true}},
+        kUsage);
     options.Parse(argc, argv);
     if (options.WantsHelp()) {
         std::fputs(kUsage, stdout);
@@ -128,9 +129,10 @@ int RunDiagnose(int argc, char** argv) {
     ConfigureLogging(options);
     RouteInterrupts();
 
+    const ModuleClient module(options.Value("module"));
     ComPtr<IAdvancedPortManager> pm;
-    HRESULT hr = portmanager::CAdvancedPortManager::CreateInstance(IID_IAdvancedPortManager,
-                                                                   pm.GetVoidAddressOf());
+    HRESULT hr =
+        module.Create(CLSID_AdvancedPortManager, IID_IAdvancedPortManager, pm.GetVoidAddressOf());
     if (FAILED(hr)) {
         std::fprintf(stderr, "nqpm: cannot create the port manager (0x%08X)\n",
                      static_cast<unsigned>(hr));
@@ -146,6 +148,7 @@ int RunDiagnose(int argc, char** argv) {
         std::fprintf(stderr, "nqpm: cannot connect to the port manager's events\n");
         return kExitFailed;
     }
+    module.ConfigureLogging(LogSettingsOf(options), pm.Get());
     BStr a(wellKnown), s(stun), e(echo.host);
     hr = pm->DiagnoseNetwork(a.Get(), s.Get(), e.Get(), echo.port, static_cast<LONG>(timeout),
                              kCookie);
@@ -155,7 +158,7 @@ int RunDiagnose(int argc, char** argv) {
         return kExitFailed;
     }
     Progress("diagnosing the network (interface, DNS, STUN, echo server)");
-    platform::RunMessageLoopUntil([&] { return client.done; }, -1);
+    module.RunUntil([&] { return client.done; }, -1);
     point->Unadvise(cookie);
     pm->Shutdown();
     if (!client.done) {

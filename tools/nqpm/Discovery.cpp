@@ -81,13 +81,7 @@ DiscoveryOptions ReadDiscoveryOptions(const Options& options) {
     d.stun = !options.Has("no-stun");
     d.timeoutSeconds = options.Seconds("timeout", 60);
     d.modulePath = options.Value("module");
-    if (options.Has("log-level") || options.Has("log-folder")) {
-        d.log.level =
-            options.Has("log-level") ? static_cast<int>(options.Integer("log-level", 0, 4)) : 2;
-    }
-    if (options.Has("log-folder")) {
-        d.log.folder = options.Value("log-folder");
-    }
+    d.log = LogSettingsOf(options);
     return d;
 }
 

@@ -14,6 +14,18 @@ std::string ModuleBesideNqpm() {
     return self.substr(0, self.find_last_of('/') + 1) + "../lib/libNqPortManager.so";
 }
 
+LogSettings LogSettingsOf(const Options& options) {
+    LogSettings log;
+    if (options.Has("log-level") || options.Has("log-folder")) {
+        log.level =
+            options.Has("log-level") ? static_cast<int>(options.Integer("log-level", 0, 4)) : 2;
+    }
+    if (options.Has("log-folder")) {
+        log.folder = options.Value("log-folder");
+    }
+    return log;
+}
+
 ModuleClient::ModuleClient(const std::string& modulePath) {
     std::string error;
     const HRESULT hr = modulePath.empty()

@@ -10,6 +10,8 @@
 #include <nqportmanager/NqPortManager.h>
 #include <nqportmanager/client.h>
 
+#include "tools/nqpm/Cli.h"
+
 namespace nqpm {
 
 // What nqpm's --log-level and --log-folder ask of a logger.
@@ -17,6 +19,9 @@ struct LogSettings {
     std::optional<int> level;
     std::optional<std::string> folder;
 };
+
+// The settings of nqpm's own --log-level and --log-folder.
+LogSettings LogSettingsOf(const Options& options);
 
 class ModuleClient {
   public:

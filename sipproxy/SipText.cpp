@@ -33,6 +33,43 @@ std::string ReplaceInHeaders(const std::string& text, const std::string& pattern
     return ReplaceAll(text.substr(0, end), pattern, replacement) + text.substr(end);
 }
 
+namespace {
+bool IsLineSpace(char c) {
+    return c == ' ' || c == '\t';
+}
+
+// Whether text[begin, end) is the header name `name` (lower case), blanks before the colon
+// allowed.
+bool IsHeaderName(const std::string& text, size_t begin, size_t end, const std::string& name) {
+    while (end > begin && IsLineSpace(text[end - 1])) {
+        --end;
+    }
+    if (end - begin != name.size()) {
+        return false;
+    }
+    for (size_t i = 0; i < name.size(); ++i) {
+        char c = text[begin + i];
+        if (c >= 'A' && c <= 'Z') {
+            c = static_cast<char>(c - 'A' + 'a');
+        }
+        if (c != name[i]) {
+            return false;
+        }
+    }
+    return true;
+}
+
+// A Call-ID is an opaque word that often ends in "@host"; changing it breaks the dialog.
+bool InCallIdHeader(const std::string& text, size_t at) {
+    const size_t previous = at < 2 ? std::string::npos : text.rfind("\r\n", at - 2);
+    const size_t lineStart = previous == std::string::npos ? 0 : previous + 2;
+    const size_t colon = text.find(':', lineStart);
+    return colon != std::string::npos && colon < at &&
+           (IsHeaderName(text, lineStart, colon, "call-id") ||
+            IsHeaderName(text, lineStart, colon, "i"));
+}
+}  // namespace
+
 std::string ReplaceBareHost(const std::string& text, const std::string& pattern,
                             const std::string& replacement) {
     if (pattern.empty()) {
@@ -50,7 +87,7 @@ std::string ReplaceBareHost(const std::string& text, const std::string& pattern,
             break;
         }
         const bool keep = work[after] == ':' || work.compare(after, 8, ";dstport") == 0 ||
-                          at <= 1 || work[at - 1] == '=';
+                          at <= 1 || work[at - 1] == '=' || InCallIdHeader(work, at);
         if (keep) {
             start = after;
             continue;
@@ -82,32 +119,8 @@ int32_t SaturatingAtoi(const std::string& text) {
     return static_cast<int32_t>(negative ? -value : value);
 }
 
-bool IsLineSpace(char c) {
-    return c == ' ' || c == '\t';
-}
-
 bool IsContentLengthName(const std::string& text, size_t begin, size_t end) {
-    while (end > begin && IsLineSpace(text[end - 1])) {
-        --end;
-    }
-    static const std::string kLong = "content-length";
-    const size_t length = end - begin;
-    if (length == 1) {
-        return text[begin] == 'l' || text[begin] == 'L';
-    }
-    if (length != kLong.size()) {
-        return false;
-    }
-    for (size_t i = 0; i < length; ++i) {
-        char c = text[begin + i];
-        if (c >= 'A' && c <= 'Z') {
-            c = static_cast<char>(c - 'A' + 'a');
-        }
-        if (c != kLong[i]) {
-            return false;
-        }
-    }
-    return true;
+    return IsHeaderName(text, begin, end, "content-length") || IsHeaderName(text, begin, end, "l");
 }
 }  // namespace
 

@@ -21,7 +21,8 @@ std::string ReplaceInHeaders(const std::string& text, const std::string& pattern
                              const std::string& replacement);
 
 // Replaces the pattern where it stands as a bare host: not at the very start, not followed by
-// ":" or ";dstport", not right after "=", and not at the end of the text.
+// ":" or ";dstport", not right after "=", not at the end of the text, and not in a Call-ID
+// header (an opaque word such as 1-42@198.51.100.20, which the dialog is matched by).
 std::string ReplaceBareHost(const std::string& text, const std::string& pattern,
                             const std::string& replacement);
 

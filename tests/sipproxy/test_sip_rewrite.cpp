@@ -96,13 +96,13 @@ INSTANTIATE_TEST_SUITE_P(
         Case{"ServerRequestBeforeAnyRegister", From::Server, false,
              "NOTIFY sip:x SIP/2.0\r\nContact: <sip:203.0.113.7:40000>\r\n\r\n",
              "NOTIFY sip:x SIP/2.0\r\nContact: <sip::0>\r\n\r\n"},
-        Case{"BareServerHostButNotReceived", From::Server, true,
+        Case{"BareServerHostButNotReceivedNorCallId", From::Server, true,
              "SIP/2.0 200 OK\r\nVia: SIP/2.0/UDP 10.0.0.5:31000;received=198.51.100.20;x\r\n"
-             "Record-Route: <sip:198.51.100.20;lr>\r\nVia: SIP/2.0/UDP 198.51.100.20\r\nCSeq: "
-             "1\r\n\r\n",
+             "Record-Route: <sip:198.51.100.20;lr>\r\nVia: SIP/2.0/UDP 198.51.100.20\r\n"
+             "Call-ID: 1-42@198.51.100.20\r\ni: 2@198.51.100.20;x\r\n\r\n",
              "SIP/2.0 200 OK\r\nVia: SIP/2.0/UDP 10.0.0.5:31000;received=198.51.100.20;x\r\n"
-             "Record-Route: <sip:10.0.0.5:31000;lr>\r\nVia: SIP/2.0/UDP 10.0.0.5:31000\r\nCSeq: "
-             "1\r\n\r\n"},
+             "Record-Route: <sip:10.0.0.5:31000;lr>\r\nVia: SIP/2.0/UDP 10.0.0.5:31000\r\n"
+             "Call-ID: 1-42@198.51.100.20\r\ni: 2@198.51.100.20;x\r\n\r\n"},
         Case{"ServerBodyIsNotSearched", From::Server, true,
              "MESSAGE sip:x SIP/2.0\r\nContent-Length: 54\r\n\r\n"
              "203.0.113.7:40000 198.51.100.20:5060 198.51.100.20;lr",

@@ -50,6 +50,12 @@ class CLocalSipProxy final : public portmanager::NoTypeInfoDispatch<ILocalSipPro
                                  platform::LPARAM lParam, bool& handled) override;
 
     RelayCounts Counts() const;
+    // After a successful Start: what the server is to use for the client, and the server.
+    std::string PublicContact() const { return m_rewriter.Texts().m_publicContact; }
+    std::string ServerEndpoint() const {
+        return m_rewriter.Texts().m_serverAddress + ":" +
+               std::to_string(m_rewriter.Texts().m_serverPort);
+    }
 
   private:
     CLocalSipProxy() = default;

@@ -12,6 +12,7 @@ int RunClassify(int argc, char** argv);
 int RunDiscover(int argc, char** argv);
 int RunProfile(int argc, char** argv);
 int RunMonitor(int argc, char** argv);
+int RunProxy(int argc, char** argv);
 
 // {"results":[{"local":..,"result":..,"code":..,"public":..|null}],"text":..}
 Json ClassificationJson(const stun::STUNResultList& list);

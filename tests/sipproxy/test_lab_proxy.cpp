@@ -86,6 +86,7 @@ TEST_F(LabProxy, SippRegistersThroughTheProxyAndTheRegistrarStoresThePublicConta
     }
     ASSERT_NE(first.find('\n'), std::string::npos) << "nqpm proxy printed nothing: " << first;
     const auto started = testsupport::ParseJson(first.substr(0, first.find('\n')));
+    ASSERT_TRUE(started.is_object());
     const std::string sender = started["sender_endpoint"].get<std::string>();
     const std::string contact = started["public_contact"].get<std::string>();
     EXPECT_EQ(sender.rfind(client + ":", 0), 0u) << first;
@@ -110,6 +111,7 @@ TEST_F(LabProxy, SippRegistersThroughTheProxyAndTheRegistrarStoresThePublicConta
     EXPECT_EQ(nqpm.Stop(5000), 0);  // SIGTERM ends the relay, the process exits 0
     const std::string out = Read(dir + "nqpm.out");
     const auto finished = testsupport::ParseJson(out.substr(first.find('\n') + 1));
+    ASSERT_TRUE(finished.is_object());
     EXPECT_EQ(finished["to_server"].get<int>(), 1) << out;
     EXPECT_EQ(finished["to_client"].get<int>(), 1) << out;
 }

@@ -1,5 +1,6 @@
 // `nqpm proxy` behind a port restricted cone NAT: sipp registers through it with a real
-// Kamailio registrar, which stores the proxy's public contact, and the 200 OK comes back.
+// Kamailio registrar, which stores the proxy's public contact, and the 200 OK comes back; a call
+// from the server's side then reaches the client through the registrar and the proxy.
 #include <gtest/gtest.h>
 
 #include <filesystem>
@@ -69,7 +70,7 @@ class LabProxy : public ::testing::Test {
     Process kamailio;
 };
 
-TEST_F(LabProxy, SippRegistersThroughTheProxyAndTheRegistrarStoresThePublicContact) {
+TEST_F(LabProxy, SippRegistersWithThePublicContactAndACallComesBack) {
     StartRegistrar();
     const std::string client = lab.Info("CLIENT_ADDR");
     Process nqpm;
@@ -108,12 +109,29 @@ TEST_F(LabProxy, SippRegistersThroughTheProxyAndTheRegistrarStoresThePublicConta
     ASSERT_EQ(Kamcmd("ul.dump", &dump), 0);
     EXPECT_NE(dump.find("Address: sip:alice@" + contact + "\n"), std::string::npos) << dump;
 
+    // A call from the server's side to the registered contact: the registrar forwards it to the
+    // public contact, the proxy to the client, and the answers go back the same way.
+    Process callee;
+    ASSERT_TRUE(callee.Start({"ip", "netns", "exec", lab.Info("CLIENT_NS"), "sipp", "-sn", "uas",
+                              "-i", client, "-p", "5062", "-m", "1", "-nostdin", "-timeout", "20s"},
+                             dir + "callee.out"));
+    platform::Sleep(300);  // sipp binds its socket
+    std::string callerScreen;
+    EXPECT_EQ(lab.Run(lab.Info("SERVER_NS"),
+                      {"sipp", "-sn", "uac", std::string(kServer) + ":5060", "-s", "alice", "-i",
+                       lab.Info("STUN2"), "-p", "5070", "-m", "1", "-nostdin", "-timeout", "15s"},
+                      &callerScreen),
+              0)
+        << callerScreen << Read(dir + "kamailio.log");
+    EXPECT_EQ(callee.Stop(5000), 0) << Read(dir + "callee.out");
+
     EXPECT_EQ(nqpm.Stop(5000), 0);  // SIGTERM ends the relay, the process exits 0
     const std::string out = Read(dir + "nqpm.out");
     const auto finished = testsupport::ParseJson(out.substr(first.find('\n') + 1));
     ASSERT_TRUE(finished.is_object());
-    EXPECT_EQ(finished["to_server"].get<int>(), 1) << out;
-    EXPECT_EQ(finished["to_client"].get<int>(), 1) << out;
+    // REGISTER; 180, 200 to the INVITE and 200 to the BYE. Back: 200; INVITE, ACK and BYE.
+    EXPECT_EQ(finished["to_server"].get<int>(), 4) << out;
+    EXPECT_EQ(finished["to_client"].get<int>(), 4) << out;
 }
 
 }  // namespace

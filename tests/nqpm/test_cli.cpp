@@ -113,6 +113,10 @@ TEST(NqpmExit, BadUsageGivesTwoAndOneLineNamingTheCommand) {
         {"discover", "--stun", "x", "--timeout", "soon"},
         {"profile", "--stun", "x", "--no-upnp"},
         {"monitor", "--bogus"},
+        {"proxy", "--stun", "x", "--sip-proxy", "s", "--media-proxy", "m"},
+        {"proxy", "--internal", "10.0.0", "--stun", "x", "--sip-proxy", "s", "--media-proxy", "m"},
+        {"proxy", "--internal", "10.0.0.5", "--stun", "x", "--sip-proxy", "s", "--media-proxy", "m",
+         "--min-port", "20000"},
     };
     for (const auto& args : kBad) {
         const NqpmRun r = RunNqpm(args);

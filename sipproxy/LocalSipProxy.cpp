@@ -157,10 +157,11 @@ HRESULT CLocalSipProxy::Stop() {
     }
     platform::KillTimer(Handle(), m_timerId);
     m_timerId = 0;
-    // Each thread is woken through its own stop request and joined before its socket closes.
+    // Each thread is woken through its own stop request and joined; each sends on the other's
+    // socket, so both are gone before either socket closes.
     m_senderThread.Stop();
-    m_internalSocket.Close();
     m_receiverThread.Stop();
+    m_internalSocket.Close();
     m_externalSocket.Close();
     m_running = false;
     return S_OK;
@@ -198,6 +199,10 @@ void CLocalSipProxy::ReceiverServiceProc() {
 void CLocalSipProxy::Drop(const char* name, const char* what, uint32_t fromHost,
                           uint16_t fromPort) {
     ++m_dropped;
+    if (fromHost == 0 && fromPort == 0) {  // an oversized datagram's sender is not reported
+        NQ_LOG(name, foundation::kLogWarn, "Dropped %s datagram", what);
+        return;
+    }
     NQ_LOG(name, foundation::kLogWarn, "Dropped %s datagram from %s:%d", what,
            foundation::FormatHostAddress(fromHost).c_str(), fromPort);
 }

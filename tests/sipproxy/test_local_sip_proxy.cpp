@@ -129,6 +129,27 @@ TEST_F(Proxy, InternalAddressCannotMoveWhileRunning) {
     ExpectRegisterRelayed(client, "z9hG4bK1");
 }
 
+class ProxyWithPortlessServer : public ProxyFixture {
+  protected:
+    void SetUp() override {
+        SetUpPortManager("127.0.0.1");
+        ASSERT_EQ(sipproxy::CLocalSipProxy::CreateInstance(IID_ILocalSipProxy,
+                                                           reinterpret_cast<void**>(&proxy)),
+                  S_OK);
+    }
+};
+
+TEST_F(ProxyWithPortlessServer, ServerWithoutPortIsTakenOn5060) {
+    ASSERT_EQ(StartProxy(), S_OK);
+    auto* relay = static_cast<sipproxy::CLocalSipProxy*>(proxy);
+    EXPECT_EQ(relay->ServerEndpoint(), "127.0.0.1:5060");
+    // The mapping's public address with the external socket's own port.
+    const std::string contact = relay->PublicContact();
+    ASSERT_EQ(contact.rfind("127.0.0.2:", 0), 0u) << contact;
+    EXPECT_NE(contact.substr(10), std::to_string(sipMappingPort));
+    EXPECT_NE(contact.substr(10), std::to_string(InternalPort()));
+}
+
 // One wait of the full period: the keep-alive is exactly "CONT" from the external socket.
 TEST_F(Proxy, KeepAliveReachesTheServerEveryThirtySeconds) {
     ASSERT_EQ(StartProxy(), S_OK);

@@ -73,6 +73,18 @@ std::string UdpSocket::Receive(std::string& fromAddress, uint16_t& fromPort) {
     return std::string(buffer.data(), static_cast<size_t>(n));
 }
 
+int UdpSocket::Receive(std::string& data, uint32_t& fromHostAddress, uint16_t& fromPort) {
+    data.clear();
+    if (platform::WaitSocketReadable(m_socket.Get(), -1) != 1) {
+        return platform::kSocketError;
+    }
+    data.resize(kReceiveBuffer);
+    const int n = platform::ReceiveFrom(m_socket.Get(), data.data(), data.size(), &fromHostAddress,
+                                        &fromPort);
+    data.resize(n > 0 ? static_cast<size_t>(n) : 0);
+    return n;
+}
+
 bool UdpSocket::SendTo(const std::string& data, uint32_t hostAddress, uint16_t port) {
     if (!m_socket) {
         return false;

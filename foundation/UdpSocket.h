@@ -36,6 +36,11 @@ class UdpSocket {
     // Waits without limit for one datagram (4096 bytes at most). Empty on a closed socket or a
     // failed receive, with the out values untouched; zero bytes inside stay.
     std::string Receive(std::string& fromAddress, uint16_t& fromPort);
+    // Waits without limit for one datagram (4096 bytes at most) and says what came: the byte
+    // count (0 for an empty datagram, the sender written in host order), or kSocketError with
+    // platform::LastSocketError() telling why (kErrMessageSize: longer than the buffer, and
+    // consumed; kErrInterrupted: the calling thread's owner asked it to stop).
+    int Receive(std::string& data, uint32_t& fromHostAddress, uint16_t& fromPort);
     // True only if the whole string was sent.
     bool SendTo(const std::string& data, uint32_t hostAddress, uint16_t port);
     // Resolves with the variant whose "not found" value is kAddressNone.

@@ -10,7 +10,7 @@ NQPM_PACKAGES=(
     iproute2 nftables procps
     stun-server stun-client
     libnl-route-3-dev libminiupnpc-dev miniupnpd
-    sip-tester dnsmasq-base
+    sip-tester kamailio dnsmasq-base
 )
 
 as_root() {

@@ -251,7 +251,21 @@ struct IPortMappingProvider : public IUnknown {
                                           LONG publicPort) = 0;
 };
 
+// The local SIP proxy: the client's outbound proxy on this machine. Set InternalAddress (the
+// local address the client uses), send SIP to SenderEndpoint, and Start it with the port manager
+// whose profile is enabled: datagrams then go, rewritten, to the recommended SIP server and back.
+// Stop (or the final Release) ends the relay; no datagram from the network can end it.
+struct ILocalSipProxy : public IDispatch {
+    virtual HRESULT get_InternalAddress(BSTR* pVal) = 0;
+    virtual HRESULT put_InternalAddress(BSTR newVal) = 0;
+    virtual HRESULT get_SenderEndpoint(BSTR* pVal) = 0;
+    virtual HRESULT Start(IAdvancedPortManager* pPortManager, LONG minPort, LONG maxPort,
+                          VARIANT_BOOL vbRandomize) = 0;
+    virtual HRESULT Stop() = 0;
+};
+
 NQ_DECLARE_COM_IID(IAdvancedPortManager, IID_IAdvancedPortManager);
+NQ_DECLARE_COM_IID(ILocalSipProxy, IID_ILocalSipProxy);
 NQ_DECLARE_COM_IID(INqDiagnostics, IID_INqDiagnostics);
 NQ_DECLARE_COM_IID(_IAdvancedPortManagerEvents, DIID__IAdvancedPortManagerEvents);
 NQ_DECLARE_COM_IID(IPortManagerUpdateEvent, IID_IPortManagerUpdateEvent);

@@ -117,6 +117,10 @@ TEST(NqpmExit, BadUsageGivesTwoAndOneLineNamingTheCommand) {
         {"diagnose", "--well-known", "host.example", "--stun", "s", "--echo", "e"},
         {"diagnose", "--well-known", "192.0.2.1", "--stun", "s", "--echo", "e:0"},
         {"diagnose", "--well-known", "192.0.2.1", "--stun", "s", "--echo", "e", "--timeout", "-1"},
+        {"proxy", "--stun", "x", "--sip-proxy", "s", "--media-proxy", "m"},
+        {"proxy", "--internal", "10.0.0", "--stun", "x", "--sip-proxy", "s", "--media-proxy", "m"},
+        {"proxy", "--internal", "10.0.0.5", "--stun", "x", "--sip-proxy", "s", "--media-proxy", "m",
+         "--min-port", "20000"},
     };
     for (const auto& args : kBad) {
         const NqpmRun r = RunNqpm(args);

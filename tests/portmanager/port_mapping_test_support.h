@@ -34,6 +34,7 @@ class LoopbackSocket {
 
     bool IsBound() const { return m_handle.IsValid(); }
     uint16_t Port() const { return m_port; }
+    platform::SocketHandle Handle() const { return m_handle.Get(); }
     void Close() { m_handle.Close(); }
 
     struct Datagram {

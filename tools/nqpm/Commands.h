@@ -16,6 +16,7 @@ int RunRegister(int argc, char** argv);
 int RunUnregister(int argc, char** argv);
 int RunRegistry(int argc, char** argv);
 int RunDiagnose(int argc, char** argv);
+int RunProxy(int argc, char** argv);
 
 // {"results":[{"local":..,"result":..,"code":..,"public":..|null}],"text":..}
 Json ClassificationJson(const stun::STUNResultList& list);

@@ -21,6 +21,7 @@ const Command kCommands[] = {
     {"discover", nqpm::RunDiscover, "topology and recommendations of a port manager"},
     {"profile", nqpm::RunProfile, "enable a profile and hand out port mappings"},
     {"monitor", nqpm::RunMonitor, "local addresses, then every address or route change"},
+    {"proxy", nqpm::RunProxy, "relay SIP through the local proxy behind the NAT"},
     {"diagnose", nqpm::RunDiagnose, "interface, DNS, STUN and echo server tests"},
     {"register", nqpm::RunRegister, "register the module in the registry file"},
     {"unregister", nqpm::RunUnregister, "remove the module's registration"},

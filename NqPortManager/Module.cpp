@@ -10,6 +10,7 @@
 #include "platform/module.h"
 #include "platform/modulelock.h"
 #include "portmanager/AdvancedPortManager.h"
+#include "sipproxy/LocalSipProxy.h"
 
 namespace {
 
@@ -17,6 +18,13 @@ using Creator = HRESULT (*)(IUnknown* outer, REFIID riid, void** ppv);
 
 HRESULT CreatePortManager(IUnknown* outer, REFIID riid, void** ppv) {
     return portmanager::CAdvancedPortManager::CreateInstance(outer, riid, ppv);
+}
+
+HRESULT CreateSipProxy(IUnknown* outer, REFIID riid, void** ppv) {
+    if (outer != nullptr) {
+        return CLASS_E_NOAGGREGATION;
+    }
+    return sipproxy::CLocalSipProxy::CreateInstance(riid, ppv);
 }
 
 // One per creatable class, for the module's lifetime. A reference held by a client locks the
@@ -78,10 +86,12 @@ struct ClassEntry {
 };
 
 ClassFactory g_portManagerFactory(CreatePortManager);
+ClassFactory g_sipProxyFactory(CreateSipProxy);
 
 // The creatable classes, in the order of registration.
 const ClassEntry kClasses[] = {
     {{&CLSID_AdvancedPortManager, "AdvancedPortManager"}, &g_portManagerFactory},
+    {{&CLSID_LocalSipProxy, "LocalSipProxy"}, &g_sipProxyFactory},
 };
 
 HRESULT UpdateRegistration(bool registering, const char* function) {

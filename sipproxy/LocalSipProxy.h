@@ -11,6 +11,7 @@
 #include "foundation/UdpSocket.h"
 #include "platform/kernel.h"
 #include "platform/message.h"
+#include "platform/modulelock.h"
 #include "portmanager/Dispatch.h"
 #include "sipproxy/SipRewriter.h"
 
@@ -82,6 +83,7 @@ class CLocalSipProxy final : public portmanager::NoTypeInfoDispatch<ILocalSipPro
     std::atomic<uint64_t> m_toServer{0};
     std::atomic<uint64_t> m_toClient{0};
     std::atomic<uint64_t> m_dropped{0};
+    platform::ModuleReference m_moduleLock;
 };
 
 }  // namespace sipproxy

@@ -124,6 +124,23 @@ TEST_F(Module, ClassTableFactoriesAndTheLockCount) {
     container.Reset();
     EXPECT_EQ(canUnloadNow_(), S_OK);
 
+    // The proxy is created alone; it cannot be aggregated.
+    ComPtr<IClassFactory> proxyFactory;
+    ASSERT_EQ(
+        getClassObject_(CLSID_LocalSipProxy, IID_IClassFactory, proxyFactory.GetVoidAddressOf()),
+        S_OK);
+    ComPtr<ILocalSipProxy> proxy;
+    ASSERT_EQ(proxyFactory->CreateInstance(nullptr, IID_ILocalSipProxy, proxy.GetVoidAddressOf()),
+              S_OK);
+    IUnknown* aggregate = nullptr;
+    EXPECT_EQ(proxyFactory->CreateInstance(proxy.Get(), IID_IUnknown,
+                                           reinterpret_cast<void**>(&aggregate)),
+              CLASS_E_NOAGGREGATION);
+    proxyFactory.Reset();
+    EXPECT_EQ(canUnloadNow_(), S_FALSE) << "a live proxy";
+    proxy.Reset();
+    EXPECT_EQ(canUnloadNow_(), S_OK);
+
     factory = Factory();
     ASSERT_EQ(factory->LockServer(1), S_OK);
     factory.Reset();
@@ -202,6 +219,10 @@ TEST_F(Module, RegistrationRoundTripsInTheRegistryFileAndRefusesABrokenOne) {
               "NqPortManager.AdvancedPortManager.1");
     EXPECT_EQ(root.FindPath(clsid + "\\TypeLib")->values.at("").text,
               GuidToString(LIBID_NqPortManagerLib));
+    EXPECT_NE(root.FindPath("CLSID\\" + GuidToString(CLSID_LocalSipProxy) + "\\InprocServer32"),
+              nullptr);
+    EXPECT_EQ(root.FindPath("CLSID\\" + GuidToString(CLSID_PortManagerUpdateEvent)), nullptr)
+        << "the event classes are not registered";
     ASSERT_EQ(register_(), S_OK) << "twice";
 
     // A client that knows only the ProgID finds, loads and creates the class.

@@ -76,7 +76,7 @@ class ProxyFixture : public ::testing::Test {
     }
     HRESULT StartProxy() {
         const HRESULT hr = SetInternal();
-        return FAILED(hr) ? hr : proxy->Start(h.pm, 0, 0, VARIANT_FALSE);
+        return FAILED(hr) ? hr : proxy->Start(h.pm.Get(), 0, 0, VARIANT_FALSE);
     }
     std::string SenderEndpoint() {
         BStr e;

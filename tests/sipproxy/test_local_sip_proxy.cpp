@@ -100,7 +100,7 @@ TEST_F(Proxy, StopIsPromptIdempotentAndStartWorksAgainUntilReleaseFreesEverythin
     EXPECT_EQ(proxy->Stop(), S_OK);  // before any Start
     ASSERT_EQ(StartProxy(), S_OK);
     EXPECT_EQ(CountThreads(), threads + 2);
-    EXPECT_EQ(proxy->Start(h.pm, 0, 0, VARIANT_FALSE), S_OK);  // running: nothing more
+    EXPECT_EQ(proxy->Start(h.pm.Get(), 0, 0, VARIANT_FALSE), S_OK);  // running: nothing more
     EXPECT_EQ(CountThreads(), threads + 2);
     auto client = std::make_unique<LoopbackSocket>();
     ExpectRegisterRelayed(*client, "z9hG4bK1");

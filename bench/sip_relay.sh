@@ -61,7 +61,7 @@ uas=$(nsx sipp -sf "$root/bench/sip/options_uas.xml" -i "$addr" -p 5070 -nostdin
     sed -n 's/.*PID=\[\([0-9]*\)\].*/\1/p' || true)
 [ -n "$uas" ] || { echo "sipp answerer did not start" >&2; exit 1; }
 pids+=("$uas")
-nsx stund -h "$addr" -a 10.77.0.2 -p 3478 -o 3479 >/dev/null 2>&1 &
+ip netns exec "$ns" stund -h "$addr" -a 10.77.0.2 -p 3478 -o 3479 >/dev/null 2>&1 &
 pids+=($!)
 
 # run NAME TARGET PIDS...: one sipp caller per rate against TARGET.

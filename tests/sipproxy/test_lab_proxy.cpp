@@ -41,6 +41,13 @@ class LabProxy : public ::testing::Test {
         ASSERT_TRUE(lab.Up());
     }
 
+    void TearDown() override {
+        kamailio.Stop();
+        if (!dir.empty() && !HasFailure()) {
+            std::filesystem::remove_all(dir);  // kept for a look when the test failed
+        }
+    }
+
     // Kamailio in the server's namespace, trusted once its control socket answers.
     void StartRegistrar() {
         control = dir + "kamailio.ctl";

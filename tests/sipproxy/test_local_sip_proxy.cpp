@@ -248,6 +248,11 @@ TEST_F(ProxyWithSipp, RegisterPassesWithThePublicContact) {
         Read(uacLog).find("contact Contact: <sip:alice@127.0.0.1:" + std::to_string(uacPort) + ">"),
         std::string::npos)
         << Read(uacLog);
+    if (!HasFailure()) {  // kept for a look when the test failed
+        for (const std::string& f : {uasLog, uacLog, dir + "nqpm-sipp-uas-" + tag + ".out"}) {
+            std::remove(f.c_str());
+        }
+    }
 }
 
 }  // namespace

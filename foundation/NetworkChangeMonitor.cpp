@@ -103,6 +103,7 @@ void CNetworkChangeMonitor::RefreshLocalIPs() {
 }
 
 void CNetworkChangeMonitor::MonitorThread() {
+    constexpr const char* kFunction = "CNetworkChangeMonitor::MonitorThread";
     if (!m_watcher->IsOpen()) {
         return;
     }
@@ -118,16 +119,14 @@ void CNetworkChangeMonitor::MonitorThread() {
             }
             if (r == platform::WaitResult::Failed) {
                 // Retrying would spin on a descriptor that poll refuses.
-                NQ_LOG("CNetworkChangeMonitor::MonitorThread", kLogError, "%s",
-                       "Waiting for address and route changes failed");
+                NQ_LOG(kFunction, kLogError, "%s", "Waiting for address and route changes failed");
                 return;
             }
         }
         const platform::NetworkChanges changes = m_watcher->Read();
         if (changes.failed) {
             // A broken socket stays readable: waiting on it again would spin.
-            NQ_LOG("CNetworkChangeMonitor::MonitorThread", kLogError, "%s",
-                   "Reading address and route changes failed");
+            NQ_LOG(kFunction, kLogError, "%s", "Reading address and route changes failed");
             return;
         }
         addressPending = addressPending || changes.addresses;

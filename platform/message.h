@@ -63,6 +63,10 @@ bool RunMessageLoopUntil(const std::function<bool()>& done, int timeoutMs);
 void RunMessageLoop();
 void QuitMessageLoop();
 
+// Wakes the calling thread's loop too while fd is readable (another loop's descriptor, say), so
+// that the done() of RunMessageLoopUntil can serve it. False when it cannot be watched.
+bool WatchInMessageLoop(int fd);
+
 // Makes Ctrl-C (SIGINT) and SIGTERM a source of the calling thread's loop: from this call on
 // they no longer end the process; once one arrives, RunMessageLoop and RunMessageLoopUntil on
 // this thread return at once (and so does every later call), and InterruptRequested() is true.

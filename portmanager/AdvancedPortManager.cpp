@@ -30,27 +30,31 @@ PortManagerServices PortManagerServices::Default() {
     return s;
 }
 
-HRESULT CAdvancedPortManager::CreateInstance(REFIID riid, void** ppv,
+HRESULT CAdvancedPortManager::CreateInstance(IUnknown* outer, REFIID riid, void** ppv,
                                              PortManagerServices services) {
     if (ppv == nullptr) {
         return E_POINTER;
     }
     *ppv = nullptr;
-    auto* object = new (std::nothrow) CAdvancedPortManager(std::move(services));
+    if (outer != nullptr && riid != IID_IUnknown) {
+        return CLASS_E_NOAGGREGATION;
+    }
+    auto* object = new (std::nothrow) CAdvancedPortManager(std::move(services), outer);
     if (object == nullptr) {
         return E_OUTOFMEMORY;
     }
-    object->AddRef();  // keeps it alive through a failed construction or query
+    // Held through a failed construction or query; the caller's reference comes from the query.
+    const ComPtr<IUnknown> inner(&object->m_inner);
     HRESULT hr = object->FinalConstruct();
     if (SUCCEEDED(hr)) {
-        hr = object->QueryInterface(riid, ppv);
+        hr = inner->QueryInterface(riid, ppv);
     }
-    object->Release();
     return hr;
 }
 
-CAdvancedPortManager::CAdvancedPortManager(PortManagerServices services)
-    : m_services(std::move(services)),
+CAdvancedPortManager::CAdvancedPortManager(PortManagerServices services, IUnknown* outer)
+    : m_controlling(outer != nullptr ? outer : &m_inner),
+      m_services(std::move(services)),
       m_upnpDetector(*m_services.upnpProbe),
       m_monitor(*m_services.networkInfo) {
     ResetToDefaults();
@@ -76,16 +80,8 @@ void CAdvancedPortManager::FinalRelease() {
         platform::KillTimer(Handle(), m_refreshTimerId);
         m_refreshTimerId = 0;
     }
-    if (m_pStunResult) {
-        m_pStunResult.reset();
-    }
-    m_sparePool.CloseFree();
-    m_audioRtpPool.CloseFree();
-    m_audioRtcpPool.CloseFree();
-    m_videoRtpPool.CloseFree();
-    m_videoRtcpPool.CloseFree();
-    m_sipMappings.clear();
-    m_mediaMappings.clear();
+    m_pStunResult.reset();
+    m_profile.Close();
     m_workerWindow.store(nullptr);
     DestroyMessageWindow();
 }
@@ -110,49 +106,57 @@ void CAdvancedPortManager::ResetToDefaults() {
     m_refreshTimerId = 0;
 }
 
-void CAdvancedPortManager::ResetRecommendations() {
-    m_state = PMS_INITIALIZING;
-    m_topology = PMT_UNKNOWN;
-    m_recommendedUpnpEnabled = false;
-    m_recommendedSipServer.clear();
-    m_discoveryComplete = false;
-    m_stunAddressesInUse = false;
-}
-
-// IUnknown
+// IUnknown: every interface delegates to the controlling unknown.
 
 HRESULT CAdvancedPortManager::QueryInterface(REFIID riid, void** ppv) {
+    return m_controlling->QueryInterface(riid, ppv);
+}
+
+ULONG CAdvancedPortManager::AddRef() {
+    return m_controlling->AddRef();
+}
+
+ULONG CAdvancedPortManager::Release() {
+    return m_controlling->Release();
+}
+
+HRESULT CAdvancedPortManager::InnerUnknown::QueryInterface(REFIID riid, void** ppv) {
     if (ppv == nullptr) {
         return E_POINTER;
     }
-    if (riid == IID_IUnknown || riid == IID_IDispatch || riid == IID_IAdvancedPortManager) {
-        *ppv = static_cast<IAdvancedPortManager*>(this);
+    CAdvancedPortManager& o = owner;
+    if (riid == IID_IUnknown) {
+        *ppv = static_cast<IUnknown*>(this);
+    } else if (riid == IID_IDispatch || riid == IID_IAdvancedPortManager) {
+        *ppv = static_cast<IAdvancedPortManager*>(&o);
     } else if (riid == IID_ISupportErrorInfo) {
-        *ppv = static_cast<ISupportErrorInfo*>(this);
+        *ppv = static_cast<ISupportErrorInfo*>(&o);
     } else if (riid == IID_IConnectionPointContainer) {
-        *ppv = static_cast<IConnectionPointContainer*>(this);
+        *ppv = static_cast<IConnectionPointContainer*>(&o);
     } else if (riid == IID_IPortMappingProvider || riid == IID_IPortMappingProvider2) {
-        *ppv = static_cast<IPortMappingProvider*>(this);
+        *ppv = static_cast<IPortMappingProvider*>(&o);
     } else if (riid == IID_INqDiagnostics) {
-        *ppv = static_cast<INqDiagnostics*>(this);
+        *ppv = static_cast<INqDiagnostics*>(&o);
     } else {
         *ppv = nullptr;
         return E_NOINTERFACE;
     }
-    AddRef();
+    // Through the interface handed out: the inner count for IUnknown, the controlling one else.
+    static_cast<IUnknown*>(*ppv)->AddRef();
     return S_OK;
 }
 
-ULONG CAdvancedPortManager::AddRef() {
-    return ++m_refs;
+ULONG CAdvancedPortManager::InnerUnknown::AddRef() {
+    return ++owner.m_refs;
 }
 
-ULONG CAdvancedPortManager::Release() {
-    const ULONG left = --m_refs;
+ULONG CAdvancedPortManager::InnerUnknown::Release() {
+    const ULONG left = --owner.m_refs;
     if (left == 0) {
-        m_refs = 1;  // a reference taken and dropped during the final release must not recurse
-        FinalRelease();
-        delete this;
+        owner.m_refs =
+            1;  // a reference taken and dropped during the final release must not recurse
+        owner.FinalRelease();
+        delete &owner;
     }
     return left;
 }
@@ -164,10 +168,13 @@ HRESULT CAdvancedPortManager::InterfaceSupportsErrorInfo(REFIID riid) {
 // Connection points: exactly one, for _IAdvancedPortManagerEvents, which the object itself is.
 
 HRESULT CAdvancedPortManager::EnumConnectionPoints(IEnumConnectionPoints** ppEnum) {
-    if (ppEnum != nullptr) {
-        *ppEnum = nullptr;
+    std::vector<ComPtr<IConnectionPoint>> points;
+    try {
+        points.emplace_back(static_cast<IConnectionPoint*>(this));
+    } catch (const std::bad_alloc&) {
+        return E_OUTOFMEMORY;
     }
-    return E_NOTIMPL;
+    return ConnectionPointsEnum::Create(std::move(points), ppEnum);
 }
 
 HRESULT CAdvancedPortManager::FindConnectionPoint(REFIID riid, IConnectionPoint** ppCP) {
@@ -201,18 +208,15 @@ HRESULT CAdvancedPortManager::GetConnectionPointContainer(IConnectionPointContai
 }
 
 HRESULT CAdvancedPortManager::Advise(IUnknown* pUnkSink, DWORD* pdwCookie) {
-    return m_sinks.Advise(pUnkSink, pdwCookie);
+    return m_events.Advise(pUnkSink, pdwCookie);
 }
 
 HRESULT CAdvancedPortManager::Unadvise(DWORD dwCookie) {
-    return m_sinks.Unadvise(dwCookie);
+    return m_events.Unadvise(dwCookie);
 }
 
 HRESULT CAdvancedPortManager::EnumConnections(IEnumConnections** ppEnum) {
-    if (ppEnum != nullptr) {
-        *ppEnum = nullptr;
-    }
-    return E_NOTIMPL;
+    return m_events.EnumConnections(ppEnum);
 }
 
 // Initialisation and life
@@ -293,33 +297,6 @@ HRESULT CAdvancedPortManager::InitiateShutdown() {
     NQ_TRACE_ENTERED("CAdvancedPortManager::InitiateShutdown");
     platform::SetTimer(Handle(), SHUTDOWN_TIMER_ID, kShutdownTimerPeriodMs);
     return S_OK;
-}
-
-HRESULT CAdvancedPortManager::Refresh() {
-    // Before InitializeEx2 there is nothing to discover with, and a discovery would move the
-    // state on so that the object could never be initialised.
-    if (m_state == PMS_UNINITIALIZED) {
-        return E_FAIL;
-    }
-    ResetRecommendations();
-    if (!m_forceUpnpDisabled) {
-        m_upnpDetector.Start(Handle(), WM_PM_UPNP_DETECTED, 0);
-    } else if (!m_forceStunDisabled) {
-        StartStunDiscovery();
-    } else {
-        RecommendMediaProxy();
-        NotifyChange(PME_UPDATED);
-    }
-    return S_OK;
-}
-
-void CAdvancedPortManager::StartStunDiscovery() {
-    if (m_pStunResult && SUCCEEDED(m_pStunResult->Refresh())) {
-        return;
-    }
-    // No service (after Shutdown) or one that cannot start: the discovery ends in the fall-back.
-    RecommendMediaProxy();
-    NotifyChange(PME_UPDATED);
 }
 
 // Simple properties

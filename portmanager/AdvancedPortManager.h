@@ -15,12 +15,13 @@
 #include "diagnostics/DiagnosticRun.h"
 #include "foundation/NetworkChangeMonitor.h"
 #include "platform/message.h"
+#include "platform/modulelock.h"
 #include "platform/netinfo.h"
 #include "platform/upnp.h"
 #include "portmanager/ConnectionPoint.h"
+#include "portmanager/DiscoveryDecision.h"
 #include "portmanager/Dispatch.h"
-#include "portmanager/PortMapping.h"
-#include "portmanager/PortMappingPool.h"
+#include "portmanager/ProfileMappings.h"
 #include "portmanager/UpnpDetector.h"
 #include "stun/STUNResult.h"
 
@@ -53,6 +54,10 @@ struct PortManagerServices {
     static PortManagerServices Default();
 };
 
+// The COM identity, its connection point and its hidden window. The discovery and its
+// recommendations live in PortManagerDiscovery.cpp (the decision itself in DiscoveryDecision),
+// the profile's mappings in PortManagerProfiles.cpp (held by ProfileMappings), the window's
+// messages and the events in PortManagerWindow.cpp.
 class CAdvancedPortManager final : public ISupportErrorInfo,
                                    public IConnectionPointContainer,
                                    public IConnectionPoint,
@@ -63,9 +68,15 @@ class CAdvancedPortManager final : public ISupportErrorInfo,
                                    public foundation::INetworkChangeSink {
   public:
     // Creates the object (hidden window included) on the calling thread and returns the asked
-    // interface. E_FAIL when the window cannot be created.
-    static HRESULT CreateInstance(REFIID riid, void** ppv,
+    // interface. E_FAIL when the window cannot be created. With an outer object the port manager
+    // is aggregated: only IID_IUnknown may be asked (else CLASS_E_NOAGGREGATION), the outer gets
+    // the inner, non-delegating IUnknown, and every other interface delegates to the outer.
+    static HRESULT CreateInstance(IUnknown* outer, REFIID riid, void** ppv,
                                   PortManagerServices services = PortManagerServices::Default());
+    static HRESULT CreateInstance(REFIID riid, void** ppv,
+                                  PortManagerServices services = PortManagerServices::Default()) {
+        return CreateInstance(nullptr, riid, ppv, std::move(services));
+    }
 
     // IUnknown
     HRESULT QueryInterface(REFIID riid, void** ppv) override;
@@ -153,7 +164,17 @@ class CAdvancedPortManager final : public ISupportErrorInfo,
                                  platform::LPARAM lParam, bool& handled) override;
 
   private:
-    explicit CAdvancedPortManager(PortManagerServices services);
+    // The object's own reference count and interface table. It is the controlling unknown unless
+    // an outer object aggregates the port manager.
+    struct InnerUnknown final : IUnknown {
+        explicit InnerUnknown(CAdvancedPortManager& owner) : owner(owner) {}
+        HRESULT QueryInterface(REFIID riid, void** ppv) override;
+        ULONG AddRef() override;
+        ULONG Release() override;
+        CAdvancedPortManager& owner;
+    };
+
+    CAdvancedPortManager(PortManagerServices services, IUnknown* outer);
     ~CAdvancedPortManager() override;
 
     HRESULT FinalConstruct();
@@ -167,14 +188,20 @@ class CAdvancedPortManager final : public ISupportErrorInfo,
     void OnStunRefresh();
     void NotifyChange(PM_EVENT type);
     void OnDiagnosticComplete(platform::WPARAM wParam);
-    // Discovery outcomes
-    void RecommendMediaProxy();
-    void ApplyStunAddresses(const stun::STUNResultEntry& entry);
+    // Discovery
     void StartStunDiscovery();
+    // What the answer concludes, applied and told to the sinks (or the STUN pass started).
+    void Conclude(DiscoveryInput::Answer answer);
+    DiscoveryInput Facts(DiscoveryInput::Answer answer,
+                         const stun::STUNResultList* stunResults) const;
+    void Apply(DiscoveryOutcome outcome);
 
     std::atomic<ULONG> m_refs{0};
+    InnerUnknown m_inner{*this};
+    IUnknown* m_controlling;  // the outer object, or m_inner
+    platform::ModuleReference m_moduleLock;
     PortManagerServices m_services;
-    EventSinks m_sinks;
+    ConnectionPoint<_IAdvancedPortManagerEvents> m_events{DIID__IAdvancedPortManagerEvents};
     // A copy of the window handle for the monitor's thread, cleared before the window goes.
     std::atomic<platform::WindowHandle> m_workerWindow{nullptr};
 
@@ -201,13 +228,7 @@ class CAdvancedPortManager final : public ISupportErrorInfo,
     bool m_refreshSIP = true;
     uintptr_t m_refreshTimerId = 0;
 
-    PortMappingPool m_sparePool;
-    PortMappingPool m_audioRtpPool;
-    PortMappingPool m_audioRtcpPool;
-    PortMappingPool m_videoRtpPool;
-    PortMappingPool m_videoRtcpPool;
-    std::vector<PortMapping> m_mediaMappings;
-    std::vector<PortMapping> m_sipMappings;
+    ProfileMappings m_profile;
 
     foundation::CNetworkChangeMonitor m_monitor;
     // Stopped and joined by Shutdown and the final release, before the window goes.

@@ -4,12 +4,27 @@
 #include <optional>
 #include <string>
 
+#include <nqportmanager/ComPtr.h>
 #include <nqportmanager/com.h>
 
 namespace portmanager {
 
-// E_POINTER for a null out-pointer; E_OUTOFMEMORY when the copy cannot be made (COM raises it
-// as an error; across this interface it is the result).
+// The COM error of a text that cannot be allocated: E_OUTOFMEMORY, with error info for the caller.
+inline HRESULT RaiseOutOfMemory(REFIID iid) {
+    ComPtr<ICreateErrorInfo> create;
+    ComPtr<IErrorInfo> info;
+    static char16_t kSource[] = u"NqPortManager.AdvancedPortManager";
+    static char16_t kDescription[] = u"Out of memory";
+    if (SUCCEEDED(CreateErrorInfo(create.GetAddressOf())) && SUCCEEDED(create->SetGUID(iid)) &&
+        SUCCEEDED(create->SetSource(kSource)) && SUCCEEDED(create->SetDescription(kDescription)) &&
+        SUCCEEDED(create->QueryInterface(IID_IErrorInfo, info.GetVoidAddressOf()))) {
+        SetErrorInfo(0, info.Get());
+    }
+    return E_OUTOFMEMORY;
+}
+
+// E_POINTER for a null out-pointer; E_OUTOFMEMORY, raised as a COM error, when the copy cannot be
+// made.
 inline HRESULT CopyBstrOut(const std::string& text, BSTR* out) {
     if (out == nullptr) {
         return E_POINTER;
@@ -17,7 +32,7 @@ inline HRESULT CopyBstrOut(const std::string& text, BSTR* out) {
     BSTR copy = BstrFromUtf8(text);
     if (copy == nullptr) {
         *out = nullptr;
-        return E_OUTOFMEMORY;
+        return RaiseOutOfMemory(IID_IAdvancedPortManager);
     }
     *out = copy;
     return S_OK;

@@ -43,16 +43,16 @@ void CAdvancedPortManager::OnDiagnosticComplete(platform::WPARAM wParam) {
     if (!outcome) {
         return;  // not an outcome of ours
     }
-    INetworkDiagnosticEvent* event = nullptr;
-    if (FAILED(NetworkDiagnosticEvent::Create(outcome->m_result, outcome->m_cookie, &event))) {
+    ComPtr<INetworkDiagnosticEvent> event;
+    ComPtr<IDispatch> dispatch;
+    if (FAILED(NetworkDiagnosticEvent::Create(outcome->m_result, outcome->m_cookie,
+                                              event.GetAddressOf())) ||
+        FAILED(event.As(&dispatch))) {
         return;
     }
-    IDispatch* dispatch = nullptr;
-    if (SUCCEEDED(event->QueryInterface(IID_IDispatch, reinterpret_cast<void**>(&dispatch)))) {
-        m_sinks.Fire(PME_DIAGNOSTIC_COMPLETED, dispatch);
-        dispatch->Release();
-    }
-    event->Release();
+    m_events.Fire([&](_IAdvancedPortManagerEvents* sink) {
+        sink->Event(PME_DIAGNOSTIC_COMPLETED, dispatch.Get());
+    });
 }
 
 }  // namespace portmanager

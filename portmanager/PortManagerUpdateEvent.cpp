@@ -18,12 +18,6 @@ HRESULT PortManagerUpdateEvent::Create(IPortManagerUpdateEvent** event) {
     return S_OK;
 }
 
-PortManagerUpdateEvent::~PortManagerUpdateEvent() {
-    if (m_portManager != nullptr) {
-        m_portManager->Release();
-    }
-}
-
 HRESULT PortManagerUpdateEvent::QueryInterface(REFIID riid, void** ppv) {
     if (ppv == nullptr) {
         return E_POINTER;
@@ -53,7 +47,7 @@ HRESULT PortManagerUpdateEvent::get_PortManager(IAdvancedPortManager** pVal) {
     if (pVal == nullptr) {
         return E_POINTER;
     }
-    if (m_portManager == nullptr) {
+    if (!m_portManager) {
         // Only after a client put null on an event it received.
         *pVal = nullptr;
         return E_POINTER;
@@ -62,14 +56,11 @@ HRESULT PortManagerUpdateEvent::get_PortManager(IAdvancedPortManager** pVal) {
 }
 
 HRESULT PortManagerUpdateEvent::put_PortManager(IAdvancedPortManager* newVal) {
-    if (m_portManager != nullptr) {
-        m_portManager->Release();
-        m_portManager = nullptr;
-    }
+    m_portManager.Reset();
     if (newVal == nullptr) {
         return S_OK;
     }
-    return newVal->QueryInterface(IID_IUnknown, reinterpret_cast<void**>(&m_portManager));
+    return newVal->QueryInterface(IID_IUnknown, m_portManager.GetVoidAddressOf());
 }
 
 }  // namespace portmanager

@@ -4,8 +4,10 @@
 
 #include <atomic>
 
+#include <nqportmanager/ComPtr.h>
 #include <nqportmanager/NqPortManager.h>
 
+#include "platform/modulelock.h"
 #include "portmanager/Dispatch.h"
 
 namespace portmanager {
@@ -24,10 +26,11 @@ class PortManagerUpdateEvent final : public NoTypeInfoDispatch<IPortManagerUpdat
 
   private:
     PortManagerUpdateEvent() = default;
-    ~PortManagerUpdateEvent();
+    ~PortManagerUpdateEvent() = default;
 
     std::atomic<ULONG> m_refs{0};
-    IUnknown* m_portManager = nullptr;  // owned reference, or null
+    ComPtr<IUnknown> m_portManager;
+    platform::ModuleReference m_moduleLock;
 };
 
 }  // namespace portmanager

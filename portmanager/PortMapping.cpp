@@ -62,6 +62,7 @@ std::string PortMapping::ToString() const {
 }
 
 void PortMapping::Refresh() const {
+    constexpr const char* kFunction = "PortMapping::Refresh";
     // The 16-bit view of the ports is what goes on the wire, so 65536 counts as 0. Checked
     // before the remote is resolved: a skipped mapping costs no name look-up.
     const uint16_t localPort = static_cast<uint16_t>(m_local.m_private.m_port);
@@ -91,11 +92,10 @@ void PortMapping::Refresh() const {
     if (platform::SendTo(socket.Get(), kKeepAlive, sizeof kKeepAlive, remoteAddress, remotePort) ==
         platform::kSocketError) {
         const int error = platform::LastSocketError();
-        NQ_LOG("PortMapping::Refresh", foundation::kLogError, "Failed(%d) - %s", error,
-               ToString().c_str());
+        NQ_LOG(kFunction, foundation::kLogError, "Failed(%d) - %s", error, ToString().c_str());
         return;
     }
-    NQ_LOG("PortMapping::Refresh", foundation::kLogDebug, "Succeeded - %s", ToString().c_str());
+    NQ_LOG(kFunction, foundation::kLogDebug, "Succeeded - %s", ToString().c_str());
 }
 
 void RefreshPortMappings(const std::vector<PortMapping>& mappings) {

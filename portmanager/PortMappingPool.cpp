@@ -90,9 +90,10 @@ bool PortMappingPool::GetMapping(MappedServiceEndpoint& mapping) {
 }
 
 void PortMappingPool::ReleaseMapping(MappedServiceEndpoint& mapping) {
+    constexpr const char* kFunction = "PortMappingPool::ReleaseMapping";
     if (foundation::Logger().IsEnabledFor(foundation::kLogInfo)) {
-        NQ_LOG("PortMappingPool::ReleaseMapping", foundation::kLogInfo,
-               "MappedServiceEndpoint is Media - %s", mapping.ToString().c_str());
+        NQ_LOG(kFunction, foundation::kLogInfo, "MappedServiceEndpoint is Media - %s",
+               mapping.ToString().c_str());
     }
     const auto found =
         std::find_if(m_inUse.begin(), m_inUse.end(), [&](const MappedServiceEndpoint& m) {
@@ -101,8 +102,7 @@ void PortMappingPool::ReleaseMapping(MappedServiceEndpoint& mapping) {
     if (found != m_inUse.end()) {
         m_inUse.erase(found);
     } else {
-        NQ_LOG("PortMappingPool::ReleaseMapping", foundation::kLogError, "%s",
-               "Failed Assertion - found");
+        NQ_LOG(kFunction, foundation::kLogError, "%s", "Failed Assertion - found");
     }
     // A failed re-bind still returns the mapping, without a placeholder (m_socket invalid).
     mapping.Open(false);

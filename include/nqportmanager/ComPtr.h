@@ -25,6 +25,7 @@ inline constexpr bool ComIidDeclared = false;
 
 NQ_DECLARE_COM_IID(IUnknown, IID_IUnknown);
 NQ_DECLARE_COM_IID(IDispatch, IID_IDispatch);
+NQ_DECLARE_COM_IID(IClassFactory, IID_IClassFactory);
 NQ_DECLARE_COM_IID(IConnectionPointContainer, IID_IConnectionPointContainer);
 NQ_DECLARE_COM_IID(IConnectionPoint, IID_IConnectionPoint);
 NQ_DECLARE_COM_IID(IEnumConnections, IID_IEnumConnections);

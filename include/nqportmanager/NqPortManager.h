@@ -5,13 +5,14 @@
 // the same on every platform. Strings are BSTRs, booleans VARIANT_BOOL, results HRESULTs.
 //
 // Threads: create the objects on one thread and call them only from it. That thread must pump its
-// message queue (platform::RunMessageLoop, or platform::PumpPendingMessages whenever
-// platform::MessageQueueDescriptor() is readable): discovery outcomes, keep-alive timers and
-// events all arrive through it, and events are fired on it.
+// message queue (NqRunMessageLoop, or NqPumpPendingMessages whenever NqMessageQueueDescriptor()
+// is readable; see messageloop.h): discovery outcomes, keep-alive timers and events all arrive
+// through it, and events are fired on it.
 #pragma once
 
 #include <nqportmanager/ComPtr.h>
 #include <nqportmanager/com.h>
+#include <nqportmanager/messageloop.h>
 
 enum PM_STATE : int32_t {
     PMS_UNINITIALIZED = 0,
@@ -228,9 +229,11 @@ struct INetworkDiagnosticEvent : public IDispatch {
 // (this platform's addition; the interface above stays as clients know it).
 struct INetworkDiagnosticTests : public IUnknown {
     virtual HRESULT get_TestCount(LONG* pVal) = 0;
-    // Tests in the order of their type; E_INVALIDARG for an index outside 0..count-1.
-    virtual HRESULT GetTest(LONG index, PM_DIAGNOSTIC_TEST_TYPE* type,
-                            PM_DIAGNOSTIC_RESULT* errorCode, BSTR* additionalInfo) = 0;
+    // Tests in the order of their type, with the texts the event gives for its last test;
+    // E_INVALIDARG for an index outside 0..count-1.
+    virtual HRESULT GetTest(LONG index, PM_DIAGNOSTIC_TEST_TYPE* type, BSTR* typeText,
+                            PM_DIAGNOSTIC_RESULT* errorCode, BSTR* errorText,
+                            BSTR* additionalInfo) = 0;
 };
 
 // Port mappings of the port manager (query it from IAdvancedPortManager).
@@ -257,3 +260,11 @@ NQ_DECLARE_COM_IID(IPortManagerUpdateEvent, IID_IPortManagerUpdateEvent);
 NQ_DECLARE_COM_IID(IPortMappingProvider, IID_IPortMappingProvider);
 NQ_DECLARE_COM_IID(INetworkDiagnosticEvent, IID_INetworkDiagnosticEvent);
 NQ_DECLARE_COM_IID(INetworkDiagnosticTests, IID_INetworkDiagnosticTests);
+
+// The module's entry points, as a COM in-process server exports them (libNqPortManager.so).
+extern "C" {
+NQ_MODULE_EXPORT HRESULT DllGetClassObject(REFCLSID rclsid, REFIID riid, void** ppv);
+NQ_MODULE_EXPORT HRESULT DllCanUnloadNow();
+NQ_MODULE_EXPORT HRESULT DllRegisterServer();
+NQ_MODULE_EXPORT HRESULT DllUnregisterServer();
+}

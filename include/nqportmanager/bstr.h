@@ -9,14 +9,16 @@
 
 // Layout as on Windows: a 4-byte byte count right before the first character, then the
 // characters, then a 2-byte zero. Storage comes from malloc, so failure is a null, not a throw.
-BSTR SysAllocString(const OLECHAR* psz);
-BSTR SysAllocStringLen(const OLECHAR* strIn, UINT ui);
-BSTR SysAllocStringByteLen(const char* psz, UINT len);
-INT SysReAllocString(BSTR* pbstr, const OLECHAR* psz);
-INT SysReAllocStringLen(BSTR* pbstr, const OLECHAR* psz, UINT len);
-void SysFreeString(BSTR bstrString);
-UINT SysStringLen(BSTR pbstr);
-UINT SysStringByteLen(BSTR bstr);
+extern "C" {
+NQ_MODULE_EXPORT BSTR SysAllocString(const OLECHAR* psz);
+NQ_MODULE_EXPORT BSTR SysAllocStringLen(const OLECHAR* strIn, UINT ui);
+NQ_MODULE_EXPORT BSTR SysAllocStringByteLen(const char* psz, UINT len);
+NQ_MODULE_EXPORT INT SysReAllocString(BSTR* pbstr, const OLECHAR* psz);
+NQ_MODULE_EXPORT INT SysReAllocStringLen(BSTR* pbstr, const OLECHAR* psz, UINT len);
+NQ_MODULE_EXPORT void SysFreeString(BSTR bstrString);
+NQ_MODULE_EXPORT UINT SysStringLen(BSTR pbstr);
+NQ_MODULE_EXPORT UINT SysStringByteLen(BSTR bstr);
+}  // extern "C"
 
 // UTF-8 helpers (not part of Windows). Malformed input becomes U+FFFD.
 BSTR BstrFromUtf8(std::string_view utf8);
@@ -63,3 +65,5 @@ class BStr {
   private:
     BSTR str_ = nullptr;
 };
+
+#include <nqportmanager/bstr_utf8.h>

@@ -1,5 +1,5 @@
-// The COM interfaces the component implements or calls: IUnknown, IDispatch, ISupportErrorInfo
-// and connection points.
+// The COM interfaces the component implements or calls: IUnknown, IClassFactory, IDispatch,
+// ISupportErrorInfo and connection points.
 #pragma once
 
 #include <nqportmanager/comtypes.h>
@@ -24,6 +24,14 @@ struct IUnknown {
 
   protected:
     ~IUnknown() = default;
+};
+
+struct IClassFactory : public IUnknown {
+    virtual HRESULT CreateInstance(IUnknown* pUnkOuter, REFIID riid, void** ppvObject) = 0;
+    virtual HRESULT LockServer(INT fLock) = 0;
+
+  protected:
+    ~IClassFactory() = default;
 };
 
 struct DISPPARAMS {

@@ -90,12 +90,38 @@ consteval GUID MakeGuid(std::string_view text) {
     return g;
 }
 
-// "{XXXXXXXX-XXXX-XXXX-XXXX-XXXXXXXXXXXX}", upper case.
-std::string GuidToString(const GUID& guid);
+// "{XXXXXXXX-XXXX-XXXX-XXXX-XXXXXXXXXXXX}", upper case. Not part of Windows (its StringFromGUID2
+// writes wide characters), so it stays portable.
+inline std::string GuidToString(const GUID& guid) {
+    static constexpr char kHex[] = "0123456789ABCDEF";
+    std::string out;
+    out.reserve(38);
+    auto put = [&out](uint64_t value, int digits) {
+        for (int shift = (digits - 1) * 4; shift >= 0; shift -= 4) {
+            out.push_back(kHex[(value >> shift) & 0xF]);
+        }
+    };
+    out.push_back('{');
+    put(guid.Data1, 8);
+    out.push_back('-');
+    put(guid.Data2, 4);
+    out.push_back('-');
+    put(guid.Data3, 4);
+    out.push_back('-');
+    put(guid.Data4[0], 2);
+    put(guid.Data4[1], 2);
+    out.push_back('-');
+    for (int i = 2; i < 8; ++i) {
+        put(guid.Data4[i], 2);
+    }
+    out.push_back('}');
+    return out;
+}
 
 inline constexpr GUID GUID_NULL = {};
 inline constexpr IID IID_IUnknown = MakeGuid("00000000-0000-0000-C000-000000000046");
 inline constexpr IID IID_IDispatch = MakeGuid("00020400-0000-0000-C000-000000000046");
+inline constexpr IID IID_IClassFactory = MakeGuid("00000001-0000-0000-C000-000000000046");
 inline constexpr IID IID_IConnectionPointContainer =
     MakeGuid("B196B284-BAB4-101A-B69C-00AA00341D07");
 inline constexpr IID IID_IEnumConnectionPoints = MakeGuid("B196B285-BAB4-101A-B69C-00AA00341D07");

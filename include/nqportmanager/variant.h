@@ -66,6 +66,8 @@ typedef VARIANT VARIANTARG;
 #define V_VARIANTREF(X) ((X)->pvarVal)
 #define V_BYREF(X) ((X)->byref)
 
-void VariantInit(VARIANTARG* pvarg);
-HRESULT VariantClear(VARIANTARG* pvarg);
-HRESULT VariantCopy(VARIANTARG* pvargDest, const VARIANTARG* pvargSrc);
+extern "C" {
+NQ_MODULE_EXPORT void VariantInit(VARIANTARG* pvarg);
+NQ_MODULE_EXPORT HRESULT VariantClear(VARIANTARG* pvarg);
+NQ_MODULE_EXPORT HRESULT VariantCopy(VARIANTARG* pvargDest, const VARIANTARG* pvargSrc);
+}  // extern "C"

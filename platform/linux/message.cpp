@@ -373,6 +373,13 @@ bool RouteInterruptsToMessageLoop() {
     return epoll_ctl(ThisQueue().Descriptor(), EPOLL_CTL_ADD, fd, &ev) == 0 || errno == EEXIST;
 }
 
+bool WatchInMessageLoop(int fd) {
+    epoll_event ev{};
+    ev.events = EPOLLIN;
+    ev.data.fd = fd;
+    return epoll_ctl(ThisQueue().Descriptor(), EPOLL_CTL_ADD, fd, &ev) == 0 || errno == EEXIST;
+}
+
 bool InterruptRequested() {
     return InterruptPending();
 }

@@ -189,4 +189,28 @@ TEST(NqpmDiscover, WithBothDiscoveriesOffReportsAtOnceAndAWatchEndsOnSignals) {
     }
 }
 
+TEST(NqpmRegistry, RegisterPrintsTheClassAndUnregisterLeavesTheSharedKeys) {
+    const std::string file = ::testing::TempDir() + "nqpm-registry-" +
+                             std::to_string(platform::testing::CurrentProcessId()) + ".json";
+    std::remove(file.c_str());
+    ASSERT_EQ(RunNqpm({"register", "--registry", file}).code, 0);
+    NqpmRun listed = RunNqpm({"registry", "--registry", file, "--json"});
+    ASSERT_EQ(listed.code, 0) << listed.err;
+    std::string server;
+    const nlohmann::json keys = ParseJson(listed.out)["keys"];
+    for (const auto& key : keys) {
+        if (key["key"].get<std::string>().find("\\InprocServer32") != std::string::npos) {
+            server = key["values"]["@"].get<std::string>();
+        }
+    }
+    EXPECT_NE(server.find("/lib/libNqPortManager.so"), std::string::npos) << listed.out;
+    ASSERT_EQ(RunNqpm({"unregister", "--registry", file}).code, 0);
+    listed = RunNqpm({"registry", "--registry", file, "--json"});
+    EXPECT_EQ(ParseJson(listed.out)["keys"].size(), 3u) << listed.out;  // AppID, CLSID, TypeLib
+    const NqpmRun missing = RunNqpm({"register", "--module", "/nonexistent.so"});
+    EXPECT_EQ(missing.code, 1);
+    EXPECT_NE(missing.err.find("/nonexistent.so"), std::string::npos);
+    std::remove(file.c_str());
+}
+
 }  // namespace

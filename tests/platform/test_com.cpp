@@ -1,9 +1,12 @@
 #include "nqportmanager/com.h"
 
+#include <nqportmanager/ComPtr.h>
+
 #include <gtest/gtest.h>
 
 #include <cstring>
 #include <string>
+#include <thread>
 #include <tuple>
 #include <utility>
 #include <vector>
@@ -429,6 +432,31 @@ TEST(ComSafeArrayTypes, UnsupportedShapesNullsAndMakeBstrArray) {
     EXPECT_EQ(Str(items[1]), u"\u00FC");
     EXPECT_NE(items[2], nullptr);
     EXPECT_EQ(SafeArrayDestroy(psa), S_OK);
+}
+
+TEST(ComErrorInfo, TheThreadsErrorInfoIsHandedOverOnce) {
+    ComPtr<ICreateErrorInfo> create;
+    ASSERT_EQ(CreateErrorInfo(create.GetAddressOf()), S_OK);
+    char16_t description[] = u"Out of memory";
+    ASSERT_EQ(create->SetDescription(description), S_OK);
+    ASSERT_EQ(create->SetGUID(IID_IDispatch), S_OK);
+    ComPtr<IErrorInfo> set;
+    ASSERT_EQ(create->QueryInterface(IID_IErrorInfo, set.GetVoidAddressOf()), S_OK);
+    ASSERT_EQ(SetErrorInfo(0, set.Get()), S_OK);
+    IErrorInfo* got = nullptr;
+    std::thread([&] { EXPECT_EQ(GetErrorInfo(0, &got), S_FALSE); }).join();  // per thread
+    ASSERT_EQ(GetErrorInfo(0, &got), S_OK);
+    const ComPtr<IErrorInfo> taken = ComPtr<IErrorInfo>::Attach(got);
+    EXPECT_EQ(taken.Get(), set.Get());
+    BSTR text = nullptr;
+    ASSERT_EQ(taken->GetDescription(&text), S_OK);
+    EXPECT_EQ(Str(text), u"Out of memory");
+    SysFreeString(text);
+    GUID guid{};
+    taken->GetGUID(&guid);
+    EXPECT_EQ(guid, IID_IDispatch);
+    EXPECT_EQ(GetErrorInfo(0, &got), S_FALSE) << "taken once";
+    EXPECT_EQ(got, nullptr);
 }
 
 }  // namespace

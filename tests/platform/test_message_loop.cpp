@@ -46,9 +46,14 @@ class RecordingWindow : public platform::MessageWindow {
 
 constexpr UINT kMsg = platform::WM_USER + 123;
 
-TEST(MessageLoop, MessagePostedFromAnotherThreadIsHandledOnTheOwnerThreadInOrder) {
+// Each test: a window of the test's thread.
+class MessageLoop : public ::testing::Test {
+  protected:
+    void SetUp() override { ASSERT_TRUE(w.CreateMessageWindow()); }
     RecordingWindow w;
-    ASSERT_TRUE(w.CreateMessageWindow());
+};
+
+TEST_F(MessageLoop, MessagePostedFromAnotherThreadIsHandledOnTheOwnerThreadInOrder) {
     std::thread poster([h = w.Handle()] {
         for (WPARAM i = 0; i < 50; ++i) {
             ASSERT_TRUE(platform::PostMessage(h, kMsg, i, static_cast<LPARAM>(i) * 2));
@@ -63,9 +68,7 @@ TEST(MessageLoop, MessagePostedFromAnotherThreadIsHandledOnTheOwnerThreadInOrder
     }
 }
 
-TEST(MessageLoop, NothingIsHandledUntilTheOwnerPumps) {
-    RecordingWindow w;
-    ASSERT_TRUE(w.CreateMessageWindow());
+TEST_F(MessageLoop, NothingIsHandledUntilTheOwnerPumps) {
     ASSERT_TRUE(platform::PostMessage(w.Handle(), kMsg, 1, 0));
     EXPECT_TRUE(w.received.empty());
     EXPECT_EQ(platform::PumpPendingMessages(), 1);
@@ -73,7 +76,7 @@ TEST(MessageLoop, NothingIsHandledUntilTheOwnerPumps) {
     EXPECT_EQ(platform::PumpPendingMessages(), 0);
 }
 
-TEST(MessageLoop, PostToADestroyedWindowFailsAndQueuedMessagesAreDropped) {
+TEST_F(MessageLoop, PostToADestroyedWindowFailsAndQueuedMessagesAreDropped) {
     auto w = std::make_unique<RecordingWindow>();
     ASSERT_TRUE(w->CreateMessageWindow());
     const auto handle = w->Handle();
@@ -84,9 +87,7 @@ TEST(MessageLoop, PostToADestroyedWindowFailsAndQueuedMessagesAreDropped) {
     EXPECT_FALSE(platform::PostMessage(nullptr, kMsg, 3, 0));
 }
 
-TEST(MessageLoop, TimerTicksWithItsPeriodAndCarriesItsId) {
-    RecordingWindow w;
-    ASSERT_TRUE(w.CreateMessageWindow());
+TEST_F(MessageLoop, TimerTicksWithItsPeriodAndCarriesItsId) {
     const uint64_t start = platform::GetTickCount64();
     ASSERT_EQ(platform::SetTimer(w.Handle(), 1234, 50), 1234u);
     ASSERT_TRUE(
@@ -98,9 +99,7 @@ TEST(MessageLoop, TimerTicksWithItsPeriodAndCarriesItsId) {
     EXPECT_GE(w.received[2].tick - start, 145u);
 }
 
-TEST(MessageLoop, ReArmingAnIdReplacesItsTimer) {
-    RecordingWindow w;
-    ASSERT_TRUE(w.CreateMessageWindow());
+TEST_F(MessageLoop, ReArmingAnIdReplacesItsTimer) {
     platform::SetTimer(w.Handle(), 7, 60000);
     platform::SetTimer(w.Handle(), 7, 30);
     ASSERT_TRUE(
@@ -113,9 +112,7 @@ TEST(MessageLoop, ReArmingAnIdReplacesItsTimer) {
     EXPECT_FALSE(platform::KillTimer(w.Handle(), 7));
 }
 
-TEST(MessageLoop, KillTimerDoesNotRemoveATickAlreadyQueued) {
-    RecordingWindow w;
-    ASSERT_TRUE(w.CreateMessageWindow());
+TEST_F(MessageLoop, KillTimerDoesNotRemoveATickAlreadyQueued) {
     platform::SetTimer(w.Handle(), 5, 20);
     // A message handled first kills the timer; the tick queued behind it still arrives.
     ASSERT_TRUE(platform::PostMessage(w.Handle(), kMsg, 0, 0));
@@ -132,16 +129,12 @@ TEST(MessageLoop, KillTimerDoesNotRemoveATickAlreadyQueued) {
     EXPECT_EQ(w.Count(platform::WM_TIMER), 1u);
 }
 
-TEST(MessageLoop, TimersOfUnknownWindowsOrIdZeroAreRefused) {
-    RecordingWindow w;
-    ASSERT_TRUE(w.CreateMessageWindow());
+TEST_F(MessageLoop, TimersOfUnknownWindowsOrIdZeroAreRefused) {
     EXPECT_EQ(platform::SetTimer(w.Handle(), 0, 10), 0u);
     EXPECT_EQ(platform::SetTimer(nullptr, 3, 10), 0u);
 }
 
-TEST(MessageLoop, DescriptorIsReadableExactlyWhileWorkIsPending) {
-    RecordingWindow w;
-    ASSERT_TRUE(w.CreateMessageWindow());
+TEST_F(MessageLoop, DescriptorIsReadableExactlyWhileWorkIsPending) {
     const int fd = platform::MessageQueueDescriptor();
     platform::PumpPendingMessages();
     EXPECT_EQ(platform::WaitReadable(fd, 0), platform::WaitResult::Timeout);
@@ -157,9 +150,7 @@ TEST(MessageLoop, DescriptorIsReadableExactlyWhileWorkIsPending) {
     platform::KillTimer(w.Handle(), 9);
 }
 
-TEST(MessageLoop, HandlerMayPumpNestedAndQuitEndsTheLoop) {
-    RecordingWindow w;
-    ASSERT_TRUE(w.CreateMessageWindow());
+TEST_F(MessageLoop, HandlerMayPumpNestedAndQuitEndsTheLoop) {
     w.onMessage = [&](UINT m, WPARAM wp) {
         if (m == kMsg && wp == 1) {
             platform::PostMessage(w.Handle(), kMsg, 2, 0);
@@ -173,7 +164,7 @@ TEST(MessageLoop, HandlerMayPumpNestedAndQuitEndsTheLoop) {
     EXPECT_EQ(w.Count(kMsg), 2u);
 }
 
-TEST(MessageLoop, RunUntilGivesUpAfterItsTimeout) {
+TEST_F(MessageLoop, RunUntilGivesUpAfterItsTimeout) {
     const uint64_t start = platform::GetTickCount64();
     EXPECT_FALSE(platform::RunMessageLoopUntil([] { return false; }, 100));
     const uint64_t spent = platform::GetTickCount64() - start;
@@ -181,8 +172,9 @@ TEST(MessageLoop, RunUntilGivesUpAfterItsTimeout) {
     EXPECT_LT(spent, 1000u);
 }
 
-TEST(MessageLoop, WindowsOfAnotherThreadAreHandledThere) {
+TEST_F(MessageLoop, WindowsOfAnotherThreadAreHandledThere) {
     std::atomic<platform::WindowHandle> handle{nullptr};
+    platform::Event created;
     std::atomic<uint32_t> handledOn{0};
     std::atomic<bool> done{false};
     platform::Thread owner;
@@ -194,11 +186,10 @@ TEST(MessageLoop, WindowsOfAnotherThreadAreHandledThere) {
             done = true;
         };
         handle = w.Handle();
+        created.Set();
         platform::RunMessageLoopUntil([&] { return done.load(); }, 5000);
     }));
-    while (handle.load() == nullptr) {
-        platform::Sleep(1);
-    }
+    ASSERT_EQ(created.Wait(5000), platform::WaitResult::Signaled);
     ASSERT_TRUE(platform::PostMessage(handle, kMsg, 0, 0));
     // This thread has no window of its own; pumping here must not steal the message.
     platform::PumpPendingMessages();

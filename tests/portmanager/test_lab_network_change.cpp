@@ -43,7 +43,7 @@ TEST(LabPortManagerNetworkChange, RouteChangeFiresOneEventAndChangesNoField) {
         platform::RunMessageLoopUntil([] { return false; }, 1500);
         ASSERT_EQ(sink.received.size(), 2u);
         EXPECT_EQ(sink.received[1].type, PME_NETWORK_CHANGE);
-        EXPECT_EQ(sink.received[1].portManager, h.pm);
+        EXPECT_EQ(sink.received[1].portManager, h.pm.Get());
         EXPECT_EQ(sink.received[1].state, PMS_COMPLETED);
         PM_TOPOLOGY topology{};
         h.pm->get_Topology(&topology);

@@ -42,7 +42,7 @@ class PortManager : public ::testing::Test {
     }
     std::string Text(HRESULT (IAdvancedPortManager::*getter)(BSTR*)) {
         BSTR s = nullptr;
-        EXPECT_EQ((H().pm->*getter)(&s), S_OK);
+        EXPECT_EQ((H().pm.Get()->*getter)(&s), S_OK);
         return ToUtf8(s);
     }
     std::string Private() { return Text(&IAdvancedPortManager::get_PrivateIpAddress); }
@@ -66,7 +66,7 @@ class PortManager : public ::testing::Test {
         if (unk == nullptr) {
             return false;
         }
-        EXPECT_EQ(unk, static_cast<IUnknown*>(H().pm));
+        EXPECT_EQ(unk, static_cast<IUnknown*>(H().pm.Get()));
         unk->Release();
         return true;
     }
@@ -120,7 +120,7 @@ TEST_F(PortManager, InitializeChecksRunInOrderAndChangeNothingOnFailure) {
     BStr stun("stun.example.net");
     BStr sip("sip");
     BStr media("media");
-    IAdvancedPortManager* pm = H().pm;
+    IAdvancedPortManager* pm = H().pm.Get();
     // A null server name wins over bad ports.
     EXPECT_EQ(Init(pm, nullptr, 1, 5000, sip.Get(), media.Get()), E_POINTER);
     EXPECT_EQ(Init(pm, stun.Get(), 1023, 16, sip.Get(), media.Get()), E_INVALIDARG);
@@ -153,25 +153,21 @@ TEST_F(PortManager, InitializeChecksRunInOrderAndChangeNothingOnFailure) {
 }
 
 TEST_F(PortManager, CountOfZeroOrBelowAndAnEmptyServerAreAccepted) {
-    for (LONG count : {0, -5}) {
-        PortManagerWithFakeStun other(Services());
-        BStr empty("");
-        BStr sip("sip");
-        BStr media("media");
-        EXPECT_EQ(Init(other.pm, empty.Get(), 1024, count, sip.Get(), media.Get()), S_OK);
-    }
-}
-
-TEST_F(PortManager, InitializeExUsesTheDefaultRefreshPolicy) {
-    BStr stun("s");
+    BStr empty("");
     BStr sip("sip");
     BStr media("media");
-    RecordingSink& sink = NewSink();
-    H().Connect(sink);
-    EXPECT_EQ(H().pm->InitializeEx(stun.Get(), 5004, 16, sip.Get(), media.Get(), VARIANT_TRUE,
-                                   VARIANT_TRUE),
+    for (LONG count : {0, -5}) {
+        PortManagerWithFakeStun other(Services());
+        EXPECT_EQ(Init(other.pm.Get(), empty.Get(), 1024, count, sip.Get(), media.Get()), S_OK);
+    }
+    // InitializeEx: the same with the default refresh policy.
+    PortManagerWithFakeStun other(Services());
+    EXPECT_EQ(other.pm->InitializeEx(empty.Get(), 5004, 16, sip.Get(), media.Get(), VARIANT_TRUE,
+                                     VARIANT_TRUE),
               S_OK);
-    EXPECT_EQ(sink.received.size(), 1u);
+    EXPECT_EQ(other.pm->InitializeEx(empty.Get(), 5004, 16, sip.Get(), media.Get(), VARIANT_TRUE,
+                                     VARIANT_TRUE),
+              E_FAIL);
 }
 
 TEST_F(PortManager, BothDiscoveriesDisabledCompleteInsideInitialize) {
@@ -182,21 +178,13 @@ TEST_F(PortManager, BothDiscoveriesDisabledCompleteInsideInitialize) {
     EXPECT_EQ(sink.received[0].type, PME_UPDATED);
     EXPECT_EQ(sink.received[0].state, PMS_COMPLETED);
     EXPECT_EQ(State(), PMS_COMPLETED);
-    EXPECT_EQ(Topology(), PMT_UNKNOWN);
-    EXPECT_EQ(SipServer(), "media.example.net");
-    EXPECT_EQ(Private(), "192.0.2.10");
-    EXPECT_EQ(Public(), "192.0.2.10");
-    EXPECT_EQ(Suffix(), "");
+    EXPECT_EQ(Private(), "192.0.2.10");  // the monitor's address reached the fall-back
     EXPECT_TRUE(PortManagerRecommended());
 }
 
-TEST_F(PortManager, RefreshBeforeInitializeFailsAndChangesNothing) {
+TEST_F(PortManager, RefreshBeforeInitializeFailsAndShutdownTwiceKeepsTheState) {
     EXPECT_EQ(H().pm->Refresh(), E_FAIL);
     EXPECT_EQ(State(), PMS_UNINITIALIZED);
-    EXPECT_EQ(H().Initialize(false, false), S_OK);
-}
-
-TEST_F(PortManager, ShutdownTwiceSucceedsAndKeepsTheState) {
     ASSERT_EQ(H().Initialize(false, false), S_OK);
     EXPECT_EQ(H().pm->Shutdown(), S_OK);
     EXPECT_EQ(H().pm->Shutdown(), S_OK);
@@ -232,141 +220,38 @@ TEST_F(PortManager, UdpPacketsInPassesTheHostCounterOrItsError) {
     EXPECT_EQ(H().pm->get_UDPPacketsIn(nullptr), E_POINTER);
 }
 
-// One STUN pass with the given entries, on a fresh port manager, and what the client then reads.
-struct OutcomeCase {
-    const char* what;
-    std::vector<stun::STUNResultEntry> entries;
-    PM_TOPOLOGY topology;
-    const char* privateAddress;
-    const char* publicAddress;
-    bool viaSipProxy;
-    bool stunSuffix;
-    bool portManagerRecommended;
-    bool noLocalAddress = false;
-};
-
-class StunOutcome : public PortManager {
-  protected:
-    void Check(const OutcomeCase& c) {
-        SCOPED_TRACE(c.what);
-        Renew();
-        net.adapters.clear();
-        if (!c.noLocalAddress) {
-            net.AddInterface("192.0.2.10", "192.0.2.1");
-        }
-        H().nextList.count = static_cast<int32_t>(c.entries.size());
-        std::copy(c.entries.begin(), c.entries.end(), H().nextList.entries);
-        RecordingSink& sink = NewSink();
-        H().Connect(sink);
-        ASSERT_EQ(H().Initialize(false, true), S_OK);
-        EXPECT_EQ(State(), PMS_INITIALIZING);
-        PumpUntilEvents(sink, 1);
-        EXPECT_EQ(sink.received.size(), 1u);
-        EXPECT_EQ(State(), PMS_COMPLETED);
-        EXPECT_EQ(Topology(), c.topology);
-        EXPECT_EQ(Private(), c.privateAddress);
-        EXPECT_EQ(Public(), c.publicAddress);
-        EXPECT_EQ(SipServer(), c.viaSipProxy ? "sip.example.net" : "media.example.net");
-        EXPECT_EQ(Suffix(), c.stunSuffix ? "STUN" : "");
-        EXPECT_EQ(PortManagerRecommended(), c.portManagerRecommended);
-    }
-};
-
-TEST_F(StunOutcome, EveryResultGivesItsTopologyAddressesAndRecommendations) {
-    using namespace stun;
-    const uint32_t none = kNoPublicAddress;
-    const OutcomeCase cases[] = {
-        {"least restrictive chosen",
-         {{A, STUN_RESULT_SYMMETRIC_NAT, none}, {B, STUN_RESULT_FULL_CONE_NAT, Q}},
-         PMT_STUN_FULL_CONE_NAT,
-         "192.0.2.11",
-         "203.0.113.9",
-         true,
-         true,
-         true},
-        {"unclassified first entry stays chosen",
-         {{A, STUN_RESULT_UNKNOWN, 0}, {B, STUN_RESULT_OPEN, Q}},
-         PMT_UNKNOWN,
-         "192.0.2.10",
-         "192.0.2.10",
-         false,
-         false,
-         true},
-        {"equal results keep the first",
-         {{A, STUN_RESULT_RESTRICTED_CONE_NAT, P}, {B, STUN_RESULT_RESTRICTED_CONE_NAT, Q}},
-         PMT_STUN_RESTRICTED_CONE_NAT,
-         "192.0.2.10",
-         "198.51.100.7",
-         true,
-         true,
-         true},
-        {"open",
-         {{B, STUN_RESULT_OPEN, P}},
-         PMT_STUN_OPEN,
-         "192.0.2.11",
-         "198.51.100.7",
-         true,
-         true,
-         true},
-        {"full cone firewall",
-         {{B, STUN_RESULT_FULL_CONE_FIREWALL, P}},
-         PMT_STUN_FULL_CONE_FIREWALL,
-         "192.0.2.11",
-         "198.51.100.7",
-         true,
-         true,
-         true},
-        {"port restricted",
-         {{B, STUN_RESULT_PORT_RESTRICTED_CONE_NAT, P}},
-         PMT_STUN_PORT_RESTRICTED_CONE_NAT,
-         "192.0.2.11",
-         "198.51.100.7",
-         true,
-         true,
-         true},
-        {"symmetric firewall",
-         {{B, STUN_RESULT_SYMMETRIC_FIREWALL, P}},
-         PMT_STUN_SYMMETRIC_FIREWALL,
-         "192.0.2.11",
-         "192.0.2.11",
-         false,
-         false,
-         true},
-        {"symmetric NAT",
-         {{B, STUN_RESULT_SYMMETRIC_NAT, P}},
-         PMT_STUN_SYMMETRIC_NAT,
-         "192.0.2.11",
-         "192.0.2.11",
-         false,
-         false,
-         true},
-        {"blocked falls back to the monitor's address",
-         {{B, STUN_RESULT_BLOCKED, none}},
-         PMT_STUN_BLOCKED,
-         "192.0.2.10",
-         "192.0.2.10",
-         false,
-         false,
-         true},
-        {"blocked without any local address",
-         {{B, STUN_RESULT_BLOCKED, none}},
-         PMT_STUN_BLOCKED,
-         "",
-         "",
-         false,
-         false,
-         false,
-         true},
-        {"empty list", {}, PMT_UNKNOWN, "192.0.2.10", "192.0.2.10", false, false, true},
-    };
-    for (const auto& c : cases) {
-        Check(c);
-    }
+// The decision itself is tested as a table (test_discovery_decision.cpp); here what the client
+// reads after a STUN pass reaches the window.
+TEST_F(PortManager, NoUpnpGatewayGoesOnToStunAndTheClientReadsItsOutcome) {
+    H().nextList.count = 2;
+    H().nextList.entries[0] = {A, stun::STUN_RESULT_SYMMETRIC_NAT, stun::kNoPublicAddress};
+    H().nextList.entries[1] = {B, stun::STUN_RESULT_FULL_CONE_NAT, Q};
+    RecordingSink& sink = NewSink();
+    H().Connect(sink);
+    ASSERT_EQ(H().Initialize(true, true), S_OK);
+    EXPECT_EQ(State(), PMS_INITIALIZING);
+    PumpUntilEvents(sink, 1);
+    EXPECT_EQ(sink.received.size(), 1u);
+    EXPECT_EQ(H().stun->refreshes, 1);
+    EXPECT_EQ(State(), PMS_COMPLETED);
+    EXPECT_EQ(Topology(), PMT_STUN_FULL_CONE_NAT);
+    EXPECT_EQ(Private(), "192.0.2.11");
+    EXPECT_EQ(Public(), "203.0.113.9");
+    EXPECT_EQ(SipServer(), "sip.example.net");
+    EXPECT_EQ(Suffix(), "STUN");
+    EXPECT_TRUE(PortManagerRecommended());
 }
 
-TEST_F(StunOutcome, ValueOutsideTheResultsIsLoggedAndFallsBack) {
+TEST_F(PortManager, StunValueOutsideTheResultsIsLoggedAndFallsBack) {
     testsupport::LogCapture log;
-    Check({"value 9", {{B, 9, P}}, PMT_UNKNOWN, "192.0.2.11", "192.0.2.11", false, false, true});
+    H().nextList.count = 1;
+    H().nextList.entries[0] = {B, 9, P};
+    RecordingSink& sink = NewSink();
+    H().Connect(sink);
+    ASSERT_EQ(H().Initialize(false, true), S_OK);
+    PumpUntilEvents(sink, 1);
+    EXPECT_EQ(Topology(), PMT_UNKNOWN);
+    EXPECT_EQ(SipServer(), "media.example.net");
     bool logged = false;
     for (const auto& line : log.LinesOf("CAdvancedPortManager::OnStunRefresh")) {
         logged |= line.level == "ERROR" && line.message == "pResult->stunResult = 0x9";
@@ -432,26 +317,6 @@ TEST_F(PortManager, UpnpGatewayRecommendsTheSipProxy) {
     EXPECT_EQ(H().stun->refreshes, 0);
 }
 
-TEST_F(PortManager, NoUpnpGatewayGoesOnToStun) {
-    H().nextList.count = 1;
-    H().nextList.entries[0] = {A, stun::STUN_RESULT_PORT_RESTRICTED_CONE_NAT, P};
-    RecordingSink& sink = NewSink();
-    H().Connect(sink);
-    ASSERT_EQ(H().Initialize(true, true), S_OK);
-    PumpUntilEvents(sink, 1);
-    EXPECT_EQ(H().stun->refreshes, 1);
-    EXPECT_EQ(Topology(), PMT_STUN_PORT_RESTRICTED_CONE_NAT);
-}
-
-TEST_F(PortManager, NoUpnpGatewayWithStunDisabledFallsBack) {
-    RecordingSink& sink = NewSink();
-    H().Connect(sink);
-    ASSERT_EQ(H().Initialize(true, false), S_OK);
-    PumpUntilEvents(sink, 1);
-    EXPECT_EQ(Topology(), PMT_UNKNOWN);
-    EXPECT_EQ(SipServer(), "media.example.net");
-}
-
 TEST_F(PortManager, EventsReachEverySinkInConnectionOrder) {
     std::vector<RecordingSink*> order;
     RecordingSink& first = NewSink();
@@ -465,7 +330,7 @@ TEST_F(PortManager, EventsReachEverySinkInConnectionOrder) {
     EXPECT_EQ(order[0], &first);
     EXPECT_EQ(order[1], &second);
     // The event names the very object the sinks are connected to.
-    EXPECT_EQ(first.received[0].portManager, H().pm);
+    EXPECT_EQ(first.received[0].portManager, H().pm.Get());
 }
 
 TEST_F(PortManager, SinkThatNoLongerAnswersIsSkippedAndTheNextStillReceives) {
@@ -492,13 +357,15 @@ TEST_F(PortManager, SinkMayRefreshFromInsideItsEvent) {
 }
 
 TEST_F(PortManager, AdviseAndUnadviseErrors) {
-    IConnectionPointContainer* container = nullptr;
+    ComPtr<IConnectionPointContainer> container;
+    ASSERT_EQ(H().pm->QueryInterface(IID_IConnectionPointContainer, container.GetVoidAddressOf()),
+              S_OK);
+    ComPtr<IConnectionPoint> point;
+    EXPECT_EQ(container->FindConnectionPoint(IID_IDispatch, point.GetAddressOf()),
+              CONNECT_E_NOCONNECTION);
     ASSERT_EQ(
-        H().pm->QueryInterface(IID_IConnectionPointContainer, reinterpret_cast<void**>(&container)),
+        container->FindConnectionPoint(DIID__IAdvancedPortManagerEvents, point.GetAddressOf()),
         S_OK);
-    IConnectionPoint* point = nullptr;
-    EXPECT_EQ(container->FindConnectionPoint(IID_IDispatch, &point), CONNECT_E_NOCONNECTION);
-    ASSERT_EQ(container->FindConnectionPoint(DIID__IAdvancedPortManagerEvents, &point), S_OK);
     RecordingSink& refuser = NewSink();
     refuser.answerEventQueries = 0;
     DWORD cookie = 99;
@@ -515,49 +382,78 @@ TEST_F(PortManager, AdviseAndUnadviseErrors) {
     IID iid{};
     point->GetConnectionInterface(&iid);
     EXPECT_EQ(iid, DIID__IAdvancedPortManagerEvents);
-    point->Release();
-    container->Release();
+}
+
+TEST_F(PortManager, EnumeratorsListTheOnePointAndEveryLiveConnection) {
+    ComPtr<IConnectionPointContainer> container;
+    ASSERT_EQ(H().pm->QueryInterface(IID_IConnectionPointContainer, container.GetVoidAddressOf()),
+              S_OK);
+    ComPtr<IEnumConnectionPoints> points;
+    ASSERT_EQ(container->EnumConnectionPoints(points.GetAddressOf()), S_OK);
+    IConnectionPoint* found[2] = {};
+    ULONG fetched = 9;
+    EXPECT_EQ(points->Next(2, found, &fetched), S_FALSE);
+    ASSERT_EQ(fetched, 1u);
+    const ComPtr<IConnectionPoint> point = ComPtr<IConnectionPoint>::Attach(found[0]);
+    IID iid{};
+    point->GetConnectionInterface(&iid);
+    EXPECT_EQ(iid, DIID__IAdvancedPortManagerEvents);
+    EXPECT_EQ(points->Next(2, found, nullptr), E_POINTER);
+
+    RecordingSink& first = NewSink();
+    RecordingSink& second = NewSink();
+    H().Connect(first);
+    const DWORD cookie = H().Connect(second);
+    ComPtr<IEnumConnections> connections;
+    ASSERT_EQ(point->EnumConnections(connections.GetAddressOf()), S_OK);
+    point->Unadvise(1);  // the snapshot keeps its own reference
+    EXPECT_EQ(first.refs.load(), 1u);
+    EXPECT_EQ(connections->Skip(1), S_OK);
+    ComPtr<IEnumConnections> clone;
+    ASSERT_EQ(connections->Clone(clone.GetAddressOf()), S_OK);
+    CONNECTDATA data{};
+    ASSERT_EQ(clone->Next(1, &data, nullptr), S_OK);
+    EXPECT_EQ(data.dwCookie, cookie);
+    EXPECT_EQ(data.pUnk, static_cast<IUnknown*>(&second));
+    data.pUnk->Release();
+    EXPECT_EQ(clone->Next(1, &data, nullptr), S_FALSE);
+    EXPECT_EQ(connections->Skip(2), S_FALSE);
+    connections.Reset();
+    clone.Reset();
+    EXPECT_EQ(first.refs.load(), 0u);
 }
 
 TEST_F(PortManager, ReleasingTheObjectReleasesConnectedSinks) {
     RecordingSink& sink = NewSink();
     H().Connect(sink);
     EXPECT_EQ(sink.refs.load(), 1u);
-    H().pm->Release();
-    H().pm = nullptr;
+    H().pm.Reset();
     EXPECT_EQ(sink.refs.load(), 0u);
 }
 
 TEST_F(PortManager, EventObjectKeepsThePortManagerAndAcceptsANullPut) {
-    IPortManagerUpdateEvent* kept = nullptr;
-    ASSERT_EQ(portmanager::PortManagerUpdateEvent::Create(&kept), S_OK);
-    ASSERT_EQ(kept->put_PortManager(H().pm), S_OK);
-    IAdvancedPortManager* pm = nullptr;
-    ASSERT_EQ(kept->get_PortManager(&pm), S_OK);
-    EXPECT_EQ(pm, H().pm);
-    pm->Release();
+    ComPtr<IPortManagerUpdateEvent> kept;
+    ASSERT_EQ(portmanager::PortManagerUpdateEvent::Create(kept.GetAddressOf()), S_OK);
+    ASSERT_EQ(kept->put_PortManager(H().pm.Get()), S_OK);
+    ComPtr<IAdvancedPortManager> pm;
+    ASSERT_EQ(kept->get_PortManager(pm.GetAddressOf()), S_OK);
+    EXPECT_EQ(pm.Get(), H().pm.Get());
     EXPECT_EQ(kept->put_PortManager(nullptr), S_OK);
-    EXPECT_EQ(kept->get_PortManager(&pm), E_POINTER);
-    EXPECT_EQ(pm, nullptr);
-    kept->Release();
+    EXPECT_EQ(kept->get_PortManager(pm.GetAddressOf()), E_POINTER);
+    EXPECT_FALSE(pm);
 }
 
 TEST_F(PortManager, InterfacesAndErrorInfo) {
-    IPortMappingProvider* first = nullptr;
-    IPortMappingProvider* second = nullptr;
-    ASSERT_EQ(H().pm->QueryInterface(IID_IPortMappingProvider, reinterpret_cast<void**>(&first)),
-              S_OK);
-    ASSERT_EQ(H().pm->QueryInterface(IID_IPortMappingProvider2, reinterpret_cast<void**>(&second)),
-              S_OK);
-    EXPECT_EQ(first, second);  // one implementation under two ids
-    first->Release();
-    second->Release();
-    ISupportErrorInfo* info = nullptr;
-    ASSERT_EQ(H().pm->QueryInterface(IID_ISupportErrorInfo, reinterpret_cast<void**>(&info)), S_OK);
+    ComPtr<IPortMappingProvider> first;
+    ComPtr<IPortMappingProvider> second;
+    ASSERT_EQ(H().pm->QueryInterface(IID_IPortMappingProvider, first.GetVoidAddressOf()), S_OK);
+    ASSERT_EQ(H().pm->QueryInterface(IID_IPortMappingProvider2, second.GetVoidAddressOf()), S_OK);
+    EXPECT_EQ(first.Get(), second.Get());  // one implementation under two ids
+    ComPtr<ISupportErrorInfo> info;
+    ASSERT_EQ(H().pm->QueryInterface(IID_ISupportErrorInfo, info.GetVoidAddressOf()), S_OK);
     EXPECT_EQ(info->InterfaceSupportsErrorInfo(IID_IAdvancedPortManager), S_OK);
     EXPECT_EQ(info->InterfaceSupportsErrorInfo(IID_INqDiagnostics), S_FALSE);
     EXPECT_EQ(info->InterfaceSupportsErrorInfo(IID_IDispatch), S_FALSE);
-    info->Release();
     void* none = &info;
     EXPECT_EQ(H().pm->QueryInterface(IID_IConnectionPoint, &none), E_NOINTERFACE);
     EXPECT_EQ(none, nullptr);

@@ -1,5 +1,5 @@
-// Every NAT and firewall behaviour of the lab, classified end to end through `nqpm classify`
-// running on the lab's client host against the real stund.
+// Classification of every usable address end to end through `nqpm classify` on the lab's client
+// host against the real stund. Each behaviour alone is classified with the discovery's lab tests.
 #include <gtest/gtest.h>
 
 #include <sstream>
@@ -10,67 +10,6 @@
 
 #include "tests/support/Json.h"
 #include "tests/support/NatLab.h"
-
-namespace {
-
-struct Expectation {
-    const char* behaviour;
-    const char* result;
-    bool publicIsClient;  // open and firewall kinds: the client's own address
-    bool hasPublic;
-};
-
-const Expectation kBehaviours[] = {
-    {"open", "STUN_RESULT_OPEN", true, true},
-    {"full-cone-firewall", "STUN_RESULT_FULL_CONE_FIREWALL", true, true},
-    {"symmetric-firewall", "STUN_RESULT_SYMMETRIC_FIREWALL", true, true},
-    {"full-cone-nat", "STUN_RESULT_FULL_CONE_NAT", false, true},
-    {"restricted-cone-nat", "STUN_RESULT_RESTRICTED_CONE_NAT", false, true},
-    {"port-restricted-cone-nat", "STUN_RESULT_PORT_RESTRICTED_CONE_NAT", false, true},
-    {"symmetric-nat", "STUN_RESULT_SYMMETRIC_NAT", false, false},
-    {"blocked", "STUN_RESULT_BLOCKED", false, false},
-};
-
-using testsupport::ParseJson;
-
-class LabClassify : public ::testing::TestWithParam<int> {};
-
-TEST_P(LabClassify, NqpmClassifyNamesTheLabsBehaviourAndPublicAddress) {
-    if (!testsupport::NatLab::CanRun()) {
-        GTEST_SKIP() << "needs root, nftables and stund";
-    }
-    const Expectation& e = kBehaviours[GetParam()];
-    testsupport::NatLab lab(testsupport::NatLab::UniqueName(GetParam()), e.behaviour);
-    ASSERT_TRUE(lab.Up());
-    const std::string nqpm = std::string(NQPM_BINARY_DIR) + "/bin/nqpm";
-    std::string out;
-    ASSERT_EQ(lab.RunInClient({nqpm, "classify", "--stun", lab.Info("STUN1"), "--local",
-                               lab.Info("CLIENT_ADDR"), "--json"},
-                              &out),
-              0);
-    const nlohmann::json results = ParseJson(out)["results"];
-    ASSERT_EQ(results.size(), 1u) << out;
-    const nlohmann::json& r = results[0];
-    EXPECT_EQ(r["local"], lab.Info("CLIENT_ADDR")) << out;
-    EXPECT_EQ(r["result"], e.result) << out;
-    if (!e.hasPublic) {
-        EXPECT_TRUE(r["public"].is_null()) << out;
-    } else {
-        EXPECT_EQ(r["public"], lab.Info(e.publicIsClient ? "CLIENT_ADDR" : "PUBLIC_ADDR")) << out;
-    }
-}
-
-INSTANTIATE_TEST_SUITE_P(Behaviours, LabClassify,
-                         ::testing::Range(0, static_cast<int>(std::size(kBehaviours))),
-                         [](const ::testing::TestParamInfo<int>& info) {
-                             std::string name = kBehaviours[info.param].behaviour;
-                             for (auto& c : name) {
-                                 c = c == '-' ? '_' : c;
-                             }
-                             return name;
-                         });
-
-}  // namespace
 
 namespace {
 

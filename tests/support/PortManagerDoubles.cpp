@@ -26,16 +26,13 @@ HRESULT RecordingSink::QueryInterface(REFIID riid, void** ppv) {
 
 HRESULT RecordingSink::Event(PM_EVENT type, IDispatch* event) {
     Received r{type, nullptr, PMS_UNINITIALIZED};
-    IPortManagerUpdateEvent* update = nullptr;
-    if (event != nullptr && SUCCEEDED(event->QueryInterface(IID_IPortManagerUpdateEvent,
-                                                            reinterpret_cast<void**>(&update)))) {
-        IAdvancedPortManager* pm = nullptr;
-        if (SUCCEEDED(update->get_PortManager(&pm)) && pm != nullptr) {
-            r.portManager = pm;
-            pm->get_State(&r.state);
-            pm->Release();
-        }
-        update->Release();
+    ComPtr<IPortManagerUpdateEvent> update;
+    ComPtr<IAdvancedPortManager> pm;
+    if (event != nullptr &&
+        SUCCEEDED(event->QueryInterface(IID_IPortManagerUpdateEvent, update.GetVoidAddressOf())) &&
+        SUCCEEDED(update->get_PortManager(pm.GetAddressOf())) && pm) {
+        r.portManager = pm.Get();
+        pm->get_State(&r.state);
     }
     received.push_back(r);
     if (order != nullptr) {
@@ -84,25 +81,20 @@ PortManagerWithFakeStun::PortManagerWithFakeStun(portmanager::PortManagerService
         stun = service.get();
         return std::unique_ptr<stun::ISTUNResult>(std::move(service));
     };
-    portmanager::CAdvancedPortManager::CreateInstance(
-        IID_IAdvancedPortManager, reinterpret_cast<void**>(&pm), std::move(services));
-}
-
-PortManagerWithFakeStun::~PortManagerWithFakeStun() {
-    if (pm != nullptr) {
-        pm->Release();
-    }
+    portmanager::CAdvancedPortManager::CreateInstance(IID_IAdvancedPortManager,
+                                                      pm.GetVoidAddressOf(), std::move(services));
 }
 
 DWORD PortManagerWithFakeStun::Connect(RecordingSink& sink) {
-    IConnectionPointContainer* container = nullptr;
-    pm->QueryInterface(IID_IConnectionPointContainer, reinterpret_cast<void**>(&container));
-    IConnectionPoint* point = nullptr;
-    container->FindConnectionPoint(DIID__IAdvancedPortManagerEvents, &point);
+    ComPtr<IConnectionPointContainer> container;
+    ComPtr<IConnectionPoint> point;
     DWORD cookie = 0;
-    point->Advise(&sink, &cookie);
-    point->Release();
-    container->Release();
+    if (SUCCEEDED(
+            pm->QueryInterface(IID_IConnectionPointContainer, container.GetVoidAddressOf())) &&
+        SUCCEEDED(container->FindConnectionPoint(DIID__IAdvancedPortManagerEvents,
+                                                 point.GetAddressOf()))) {
+        point->Advise(&sink, &cookie);
+    }
     return cookie;
 }
 

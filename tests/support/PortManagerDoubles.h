@@ -71,7 +71,6 @@ class FakeStunService final : public stun::ISTUNResult {
 // services are those given.
 struct PortManagerWithFakeStun {
     explicit PortManagerWithFakeStun(portmanager::PortManagerServices services = {});
-    ~PortManagerWithFakeStun();
     PortManagerWithFakeStun(const PortManagerWithFakeStun&) = delete;
     PortManagerWithFakeStun& operator=(const PortManagerWithFakeStun&) = delete;
 
@@ -80,7 +79,7 @@ struct PortManagerWithFakeStun {
     HRESULT Initialize(bool upnp, bool stun, const char* sipProxy = "sip.example.net",
                        const char* mediaProxy = "media.example.net");
 
-    IAdvancedPortManager* pm = nullptr;
+    ComPtr<IAdvancedPortManager> pm;
     FakeStunService* stun = nullptr;  // owned by the port manager
     stun::STUNResultList nextList;    // handed to the service when it is created
     bool nextReady = true;

@@ -13,6 +13,9 @@ int RunDiscover(int argc, char** argv);
 int RunProfile(int argc, char** argv);
 int RunMonitor(int argc, char** argv);
 int RunDiagnose(int argc, char** argv);
+int RunRegister(int argc, char** argv);
+int RunUnregister(int argc, char** argv);
+int RunRegistry(int argc, char** argv);
 
 // {"results":[{"local":..,"result":..,"code":..,"public":..|null}],"text":..}
 Json ClassificationJson(const stun::STUNResultList& list);

@@ -4,7 +4,6 @@
 
 #include "platform/kernel.h"
 #include "platform/message.h"
-#include "portmanager/AdvancedPortManager.h"
 
 namespace nqpm {
 
@@ -61,8 +60,8 @@ const char* TopologyName(PM_TOPOLOGY topology) {
 }
 
 std::vector<OptionSpec> DiscoveryOptionSpecs() {
-    return {{"stun", true},     {"sip-proxy", true}, {"media-proxy", true},
-            {"no-upnp", false}, {"no-stun", false},  {"timeout", true}};
+    return {{"stun", true},     {"sip-proxy", true}, {"media-proxy", true}, {"no-upnp", false},
+            {"no-stun", false}, {"timeout", true},   {"module", true}};
 }
 
 DiscoveryOptions ReadDiscoveryOptions(const Options& options) {
@@ -81,6 +80,14 @@ DiscoveryOptions ReadDiscoveryOptions(const Options& options) {
     d.upnp = !options.Has("no-upnp");
     d.stun = !options.Has("no-stun");
     d.timeoutSeconds = options.Seconds("timeout", 60);
+    d.modulePath = options.Value("module");
+    if (options.Has("log-level") || options.Has("log-folder")) {
+        d.log.level =
+            options.Has("log-level") ? static_cast<int>(options.Integer("log-level", 0, 4)) : 2;
+    }
+    if (options.Has("log-folder")) {
+        d.log.folder = options.Value("log-folder");
+    }
     return d;
 }
 
@@ -125,8 +132,9 @@ int Discovery::Events(PM_EVENT type) const {
 
 bool Discovery::Run(const DiscoveryOptions& options) {
     RouteInterrupts();
-    HRESULT hr = portmanager::CAdvancedPortManager::CreateInstance(IID_IAdvancedPortManager,
-                                                                   m_pm.GetVoidAddressOf());
+    m_module.emplace(options.modulePath);
+    HRESULT hr = m_module->Create(CLSID_AdvancedPortManager, IID_IAdvancedPortManager,
+                                  m_pm.GetVoidAddressOf());
     if (FAILED(hr)) {
         std::fprintf(stderr, "nqpm: cannot create the port manager (0x%08X)\n",
                      static_cast<unsigned>(hr));
@@ -138,6 +146,8 @@ bool Discovery::Run(const DiscoveryOptions& options) {
         std::fprintf(stderr, "nqpm: cannot connect to the port manager's events\n");
         return false;
     }
+
+    m_module->ConfigureLogging(options.log, m_pm.Get());
 
     BStr servers(options.stunServers);
     BStr sip(options.sipProxy);
@@ -151,9 +161,8 @@ bool Discovery::Run(const DiscoveryOptions& options) {
         return false;
     }
     Progress("discovering the path to the Internet (UPnP gateway, then STUN)");
-    const bool done =
-        platform::RunMessageLoopUntil([this] { return m_events[PME_UPDATED] > 0; },
-                                      static_cast<int>(options.timeoutSeconds * 1000));
+    const bool done = m_module->RunUntil([this] { return m_events[PME_UPDATED] > 0; },
+                                         static_cast<int>(options.timeoutSeconds * 1000));
     if (!done && platform::InterruptRequested()) {
         std::fprintf(stderr, "nqpm: interrupted before the discovery reported\n");
         return false;
@@ -166,8 +175,10 @@ bool Discovery::Run(const DiscoveryOptions& options) {
 }
 
 void Discovery::PumpFor(double seconds) {
-    platform::RunMessageLoopUntil([] { return false; },
-                                  seconds < 0 ? -1 : static_cast<int>(seconds * 1000));
+    if (!m_module) {
+        return;
+    }
+    m_module->RunUntil([] { return false; }, seconds < 0 ? -1 : static_cast<int>(seconds * 1000));
 }
 
 Discovery::Report Discovery::Read() const {

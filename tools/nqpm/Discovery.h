@@ -3,12 +3,14 @@
 #pragma once
 
 #include <functional>
+#include <optional>
 #include <string>
 #include <vector>
 
 #include <nqportmanager/NqPortManager.h>
 
 #include "tools/nqpm/Cli.h"
+#include "tools/nqpm/ModuleClient.h"
 
 namespace nqpm {
 
@@ -19,6 +21,8 @@ struct DiscoveryOptions {
     bool upnp = true;
     bool stun = true;
     double timeoutSeconds = 60;
+    std::string modulePath;  // empty: the registered module, else the one beside nqpm
+    LogSettings log;
 };
 
 // The options common to `discover` and `profile`.
@@ -39,6 +43,8 @@ class Discovery final : public _IAdvancedPortManagerEvents {
     void PumpFor(double seconds);
 
     IAdvancedPortManager* PortManager() const { return m_pm.Get(); }
+    // The module the port manager came from (after Run).
+    const ModuleClient& Module() const { return *m_module; }
     // The state, topology, addresses and recommendations, as text lines or one JSON object.
     std::string ReportText() const;
     Json ReportJson() const;
@@ -67,6 +73,7 @@ class Discovery final : public _IAdvancedPortManagerEvents {
     };
     Report Read() const;
 
+    std::optional<ModuleClient> m_module;  // outlives the port manager
     ComPtr<IAdvancedPortManager> m_pm;
     DWORD m_cookie = 0;
     int m_events[4] = {0, 0, 0, 0};

@@ -22,6 +22,9 @@ const Command kCommands[] = {
     {"profile", nqpm::RunProfile, "enable a profile and hand out port mappings"},
     {"monitor", nqpm::RunMonitor, "local addresses, then every address or route change"},
     {"diagnose", nqpm::RunDiagnose, "interface, DNS, STUN and echo server tests"},
+    {"register", nqpm::RunRegister, "register the module in the registry file"},
+    {"unregister", nqpm::RunUnregister, "remove the module's registration"},
+    {"registry", nqpm::RunRegistry, "print the keys of the registry file"},
 };
 
 void PrintUsage(std::FILE* out) {

@@ -1,22 +1,22 @@
-// UTF-8 helpers over the BSTR and SAFEARRAY API. Not part of Windows, so they stay portable and
-// the Windows build keeps them next to the real oleaut32.
-#include "nqportmanager/bstr.h"
-#include "nqportmanager/safearray.h"
+// The UTF-8 conversions of BSTRs, header-only so that a client needs nothing but the module's
+// BSTR functions. Not part of Windows. Included by bstr.h; include that one.
+#pragma once
+
+#include <nqportmanager/bstr.h>
 
 #include <cstddef>
 #include <cstdint>
 #include <limits>
 #include <string>
 #include <string_view>
-#include <vector>
 
-namespace {
+namespace nq_utf8 {
 
-constexpr char32_t kReplacement = 0xFFFD;
+inline constexpr char32_t kReplacement = 0xFFFD;
 
 // Replaces each maximal invalid subpart with one U+FFFD, as Unicode recommends.
 template <typename Emit>
-void DecodeUtf8(std::string_view in, Emit&& emit) {
+inline void DecodeUtf8(std::string_view in, Emit&& emit) {
     size_t i = 0;
     const size_t n = in.size();
     while (i < n) {
@@ -72,7 +72,7 @@ void DecodeUtf8(std::string_view in, Emit&& emit) {
     }
 }
 
-void AppendUtf8(std::string& out, char32_t cp) {
+inline void AppendUtf8(std::string& out, char32_t cp) {
     if (cp < 0x80) {
         out.push_back(static_cast<char>(cp));
     } else if (cp < 0x800) {
@@ -90,12 +90,12 @@ void AppendUtf8(std::string& out, char32_t cp) {
     }
 }
 
-}  // namespace
+}  // namespace nq_utf8
 
-BSTR BstrFromUtf8(std::string_view utf8) {
+inline BSTR BstrFromUtf8(std::string_view utf8) {
     // Two passes so the only allocation is the BSTR itself.
     uint64_t units = 0;
-    DecodeUtf8(utf8, [&units](char32_t cp) { units += cp >= 0x10000 ? 2 : 1; });
+    nq_utf8::DecodeUtf8(utf8, [&units](char32_t cp) { units += cp >= 0x10000 ? 2 : 1; });
     if (units > std::numeric_limits<UINT>::max()) {
         return nullptr;
     }
@@ -104,7 +104,7 @@ BSTR BstrFromUtf8(std::string_view utf8) {
         return nullptr;
     }
     OLECHAR* p = bstr;
-    DecodeUtf8(utf8, [&p](char32_t cp) {
+    nq_utf8::DecodeUtf8(utf8, [&p](char32_t cp) {
         if (cp >= 0x10000) {
             cp -= 0x10000;
             *p++ = static_cast<OLECHAR>(0xD800 + (cp >> 10));
@@ -116,7 +116,7 @@ BSTR BstrFromUtf8(std::string_view utf8) {
     return bstr;
 }
 
-std::string Utf8FromBstr(BSTR bstr) {
+inline std::string Utf8FromBstr(BSTR bstr) {
     const std::u16string_view in = BstrView(bstr);
     std::string out;
     out.reserve(in.size());
@@ -127,35 +127,16 @@ std::string Utf8FromBstr(BSTR bstr) {
             cp = 0x10000 + ((cp - 0xD800) << 10) + (in[i + 1] - 0xDC00);
             ++i;
         } else if (cp >= 0xD800 && cp <= 0xDFFF) {
-            cp = kReplacement;
+            cp = nq_utf8::kReplacement;
         }
-        AppendUtf8(out, cp);
+        nq_utf8::AppendUtf8(out, cp);
     }
     return out;
 }
 
-std::u16string_view BstrView(BSTR bstr) {
+inline std::u16string_view BstrView(BSTR bstr) {
     if (bstr == nullptr) {
         return {};
     }
     return {bstr, SysStringLen(bstr)};
-}
-
-SAFEARRAY* MakeBstrArray(const std::vector<std::string>& utf8Items) {
-    if (utf8Items.size() > std::numeric_limits<ULONG>::max()) {
-        return nullptr;
-    }
-    SAFEARRAY* psa = SafeArrayCreateVector(VT_BSTR, 0, static_cast<ULONG>(utf8Items.size()));
-    if (psa == nullptr) {
-        return nullptr;
-    }
-    for (size_t i = 0; i < utf8Items.size(); ++i) {
-        BSTR item = BstrFromUtf8(utf8Items[i]);
-        if (item == nullptr) {
-            SafeArrayDestroy(psa);
-            return nullptr;
-        }
-        static_cast<BSTR*>(psa->pvData)[i] = item;
-    }
-    return psa;
 }

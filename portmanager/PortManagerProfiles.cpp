@@ -1,5 +1,6 @@
 // Enabling a calling profile: SIP mappings from the client's addresses, five pools of reserved
-// media ports, the first keep-alives and the keep-alive timer; and the mappings handed out.
+// media ports, the first keep-alives and the keep-alive timer; the mappings handed out and the
+// media mappings the client registers for keep-alives.
 #include <algorithm>
 #include <cstdlib>
 #include <ctime>
@@ -47,10 +48,6 @@ HRESULT WriteMapping(const MappedServiceEndpoint& m, BSTR* privateAddress, LONG*
     return S_OK;
 }
 
-bool SameEndpoints(const MappedServiceEndpoint& a, const MappedServiceEndpoint& b) {
-    return a.m_public == b.m_public && a.m_private == b.m_private;
-}
-
 }  // namespace
 
 HRESULT CAdvancedPortManager::OnBeforeEnableProfile(VARIANT networkAddresses, LONG minSipPort,
@@ -83,7 +80,8 @@ HRESULT CAdvancedPortManager::OnBeforeEnableProfileEx(VARIANT networkAddresses, 
     }
 
     std::srand(static_cast<unsigned>(std::time(nullptr)));
-    m_sipMappings.clear();
+    std::vector<PortMapping>& sipMappings = m_profile.Sip();
+    sipMappings.clear();
 
     SAFEARRAY* array = networkAddresses.parray;
     if (array != nullptr && SafeArrayGetElemsize(array) > 0) {
@@ -107,7 +105,7 @@ HRESULT CAdvancedPortManager::OnBeforeEnableProfileEx(VARIANT networkAddresses, 
             if (client.m_address == privateAddress) {
                 NQ_LOG(kFunction, foundation::kLogInfo, "Adding SIP Port Mapping for %s",
                        mapping.ToString().c_str());
-                m_sipMappings.push_back(mapping);
+                sipMappings.push_back(mapping);
             }
         }
     } else {
@@ -115,26 +113,18 @@ HRESULT CAdvancedPortManager::OnBeforeEnableProfileEx(VARIANT networkAddresses, 
                "Failed Assertion - networkAddresses.vt == (VT_ARRAY|VT_BSTR) && "
                "networkAddresses.parray->cbElements > 0");
     }
-    if (m_sipMappings.empty()) {
+    if (sipMappings.empty()) {
         return E_FAIL;
     }
 
-    const std::string p = m_sipMappings.front().m_local.m_private.m_address;
-    const std::string q = m_sipMappings.front().m_local.m_public.m_address;
-    const auto count = static_cast<uint32_t>(portsPerProtocol);
-    const bool randomize = randomizePorts != VARIANT_FALSE;
-    if (!m_sparePool.Fill(true, count <= 1 ? 2 : count, minPort, maxPort, p, q, randomize) ||
-        !m_audioRtpPool.Fill(true, count, minPort, maxPort, p, q, randomize) ||
-        !m_audioRtcpPool.Fill(false, count, minPort, maxPort, p, q, randomize) ||
-        !m_videoRtpPool.Fill(true, count, minPort, maxPort, p, q, randomize) ||
-        !m_videoRtcpPool.Fill(false, count, minPort, maxPort, p, q, randomize)) {
+    const MappedServiceEndpoint& first = sipMappings.front().m_local;
+    if (!m_profile.FillPools(static_cast<uint32_t>(portsPerProtocol), minPort, maxPort,
+                             first.m_private.m_address, first.m_public.m_address,
+                             randomizePorts != VARIANT_FALSE)) {
         return E_FAIL;
     }
-    DumpPortMappings("AudioRTP", m_audioRtpPool);
-    DumpPortMappings("AudioRTCP", m_audioRtcpPool);
-    DumpPortMappings("VideoRTP", m_videoRtpPool);
-    DumpPortMappings("VideoRTCP", m_videoRtcpPool);
-    RefreshPortMappings(m_sipMappings);
+    m_profile.DumpPools();
+    RefreshPortMappings(sipMappings);
     m_refreshTimerId =
         platform::SetTimer(Handle(), REFRESH_TIMER_ID, static_cast<uint32_t>(m_refreshInterval));
     return S_OK;
@@ -162,20 +152,19 @@ HRESULT CAdvancedPortManager::GetMapping(BSTR, LONG type, BSTR* privateAddress, 
         return E_FAIL;
     }
     if (type == SIP) {
-        if (m_sipMappings.empty()) {
+        if (m_profile.Sip().empty()) {
             NQ_LOG(kFunction, foundation::kLogError, "%s",
                    "Failed Assertion - !m_sipMappings.empty()");
             return E_FAIL;
         }
-        return WriteMapping(m_sipMappings.front().m_local, privateAddress, privatePort,
+        return WriteMapping(m_profile.Sip().front().m_local, privateAddress, privatePort,
                             publicAddress, publicPort);
     }
-    PortMappingPool* pools[] = {&m_audioRtpPool, &m_audioRtcpPool, &m_videoRtpPool,
-                                &m_videoRtcpPool};
-    if (type < AudioRTP || type > VideoRTCP) {
+    PortMappingPool* found = m_profile.MediaPool(type);
+    if (found == nullptr) {
         return S_OK;
     }
-    PortMappingPool& pool = *pools[type];
+    PortMappingPool& pool = *found;
     if (pool.Free().empty()) {
         NQ_LOG(kFunction, foundation::kLogError, "%s", "Failed Assertion - !m_free.empty()");
         return E_FAIL;
@@ -196,38 +185,52 @@ HRESULT CAdvancedPortManager::ReleaseMapping(BSTR privateAddress, LONG privatePo
     NQ_TRACE_ENTERED(kFunction);
     MappedServiceEndpoint m(NetworkEndpoint(Utf8FromBstr(privateAddress), privatePort),
                             NetworkEndpoint(Utf8FromBstr(publicAddress), publicPort));
-    for (const PortMapping& sip : m_sipMappings) {
-        if (SameEndpoints(sip.m_local, m)) {
-            // SIP mappings live until the next enable.
-            NQ_LOG(kFunction, foundation::kLogError, "MappedServiceEndpoint is SIP - %s",
-                   sip.ToString().c_str());
-            return S_OK;
-        }
-    }
     const std::string text = m.ToString();
     const MappedServiceEndpoint original = m;  // the pool's re-bind may change m's ports
-    bool released = false;
-    for (PortMappingPool* pool :
-         {&m_audioRtpPool, &m_audioRtcpPool, &m_videoRtpPool, &m_videoRtcpPool}) {
-        if (pool->IsInUse(m.m_private.m_port)) {
-            pool->ReleaseMapping(m);
-            released = true;
-            break;
-        }
-    }
-    if (!released) {
-        NQ_LOG(kFunction, foundation::kLogError,
-               "MappedServiceEndpoint not found in mapping pool - %s", text.c_str());
-    }
-    for (auto it = m_mediaMappings.begin(); it != m_mediaMappings.end(); ++it) {
-        if (SameEndpoints(it->m_local, original)) {
-            m_mediaMappings.erase(it);
+    std::string sipText;
+    switch (m_profile.ReleaseToPool(m, sipText)) {
+        case ProfileMappings::Released::Sip:
+            NQ_LOG(kFunction, foundation::kLogError, "MappedServiceEndpoint is SIP - %s",
+                   sipText.c_str());
             return S_OK;
-        }
+        case ProfileMappings::Released::NotInPool:
+            NQ_LOG(kFunction, foundation::kLogError,
+                   "MappedServiceEndpoint not found in mapping pool - %s", text.c_str());
+            break;
+        case ProfileMappings::Released::FromPool:
+            break;
+    }
+    if (m_profile.RemoveMedia(original)) {
+        return S_OK;
     }
     NQ_LOG(kFunction, foundation::kLogError, "MappedServiceEndpoint not found in media pool - %s",
            text.c_str());
     return E_FAIL;
+}
+
+HRESULT CAdvancedPortManager::UpdateRemoteAddress(LONG, LONG, LONG, LONG, LONG) {
+    NQ_TRACE_ENTERED("CAdvancedPortManager::UpdateRemoteAddress");
+    return S_OK;
+}
+
+HRESULT CAdvancedPortManager::UpdateRemoteAddressEx(BSTR remoteAddress, LONG remotePort,
+                                                    BSTR privateAddress, LONG privatePort,
+                                                    BSTR publicAddress, LONG publicPort) {
+    // A null address is taken as the empty one: its keep-alives then fail and are logged.
+    const NetworkEndpoint publicEndpoint(Utf8FromBstr(publicAddress), publicPort);
+    const NetworkEndpoint privateEndpoint(Utf8FromBstr(privateAddress), privatePort);
+    const NetworkEndpoint remoteEndpoint(Utf8FromBstr(remoteAddress), remotePort);
+    const PortMapping mapping(MappedServiceEndpoint(privateEndpoint, publicEndpoint),
+                              remoteEndpoint);
+    NQ_LOG("CAdvancedPortManager::UpdateRemoteAddressEx", foundation::kLogInfo, "%s",
+           mapping.ToString().c_str());
+    m_profile.AddMedia(mapping);
+    mapping.Refresh();
+    if (m_refreshTimerId != 0) {
+        // A full keep-alive tick shortly; the tick itself goes back to the normal period.
+        platform::SetTimer(Handle(), m_refreshTimerId, kEarlyKeepAliveMs);
+    }
+    return S_OK;
 }
 
 }  // namespace portmanager

@@ -123,11 +123,6 @@ void DiagnosticRuns::StopAll() {
     m_runs.clear();  // each thread is joined as its run goes
 }
 
-size_t DiagnosticRuns::Active() {
-    JoinFinished();
-    return m_runs.size();
-}
-
 void DiagnosticRuns::JoinFinished() {
     // A run that is done has posted (or given up) and only returns: joining it is immediate, so
     // its descriptors are gone by the time its outcome is handled.

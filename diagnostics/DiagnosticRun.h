@@ -66,8 +66,6 @@ class DiagnosticRuns {
     std::unique_ptr<DiagnosticOutcome> TakePosted(platform::WPARAM wParam);
     // Asks every run to stop and waits for it. A stopped run posts nothing.
     void StopAll();
-    // Runs whose thread has not been joined yet.
-    size_t Active();
 
   private:
     struct Run {

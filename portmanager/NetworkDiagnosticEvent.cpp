@@ -96,21 +96,33 @@ HRESULT NetworkDiagnosticEvent::get_TestCount(LONG* pVal) {
     return S_OK;
 }
 
-HRESULT NetworkDiagnosticEvent::GetTest(LONG index, PM_DIAGNOSTIC_TEST_TYPE* type,
-                                        PM_DIAGNOSTIC_RESULT* errorCode, BSTR* additionalInfo) {
-    if (type == nullptr || errorCode == nullptr || additionalInfo == nullptr) {
+HRESULT NetworkDiagnosticEvent::GetTest(LONG index, PM_DIAGNOSTIC_TEST_TYPE* type, BSTR* typeText,
+                                        PM_DIAGNOSTIC_RESULT* errorCode, BSTR* errorText,
+                                        BSTR* additionalInfo) {
+    if (type == nullptr || typeText == nullptr || errorCode == nullptr || errorText == nullptr ||
+        additionalInfo == nullptr) {
         return E_POINTER;
     }
     if (index < 0 || static_cast<size_t>(index) >= m_result.m_tests.size()) {
         return E_INVALIDARG;
     }
     const auto& record = std::next(m_result.m_tests.begin(), index)->second;
-    const HRESULT hr = CopyBstrOut(record.m_additionalInfo, additionalInfo);
+    BStr texts[3];
+    HRESULT hr = CopyBstrOut(diagnostics::TestTypeText(record.m_testType), texts[0].Out());
+    if (SUCCEEDED(hr)) {
+        hr = CopyBstrOut(diagnostics::ErrorText(record.m_errorCode), texts[1].Out());
+    }
+    if (SUCCEEDED(hr)) {
+        hr = CopyBstrOut(record.m_additionalInfo, texts[2].Out());
+    }
     if (FAILED(hr)) {
         return hr;
     }
     *type = static_cast<PM_DIAGNOSTIC_TEST_TYPE>(record.m_testType);
     *errorCode = static_cast<PM_DIAGNOSTIC_RESULT>(record.m_errorCode);
+    *typeText = texts[0].Detach();
+    *errorText = texts[1].Detach();
+    *additionalInfo = texts[2].Detach();
     return S_OK;
 }
 

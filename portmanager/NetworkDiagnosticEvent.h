@@ -31,7 +31,8 @@ class NetworkDiagnosticEvent final : public NoTypeInfoDispatch<INetworkDiagnosti
     HRESULT get_cookie(LONG* pVal) override;
 
     HRESULT get_TestCount(LONG* pVal) override;
-    HRESULT GetTest(LONG index, PM_DIAGNOSTIC_TEST_TYPE* type, PM_DIAGNOSTIC_RESULT* errorCode,
+    HRESULT GetTest(LONG index, PM_DIAGNOSTIC_TEST_TYPE* type, BSTR* typeText,
+                    PM_DIAGNOSTIC_RESULT* errorCode, BSTR* errorText,
                     BSTR* additionalInfo) override;
 
     const diagnostics::DiagnosticResult& Result() const { return m_result; }

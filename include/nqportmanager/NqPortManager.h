@@ -229,9 +229,11 @@ struct INetworkDiagnosticEvent : public IDispatch {
 // (this platform's addition; the interface above stays as clients know it).
 struct INetworkDiagnosticTests : public IUnknown {
     virtual HRESULT get_TestCount(LONG* pVal) = 0;
-    // Tests in the order of their type; E_INVALIDARG for an index outside 0..count-1.
-    virtual HRESULT GetTest(LONG index, PM_DIAGNOSTIC_TEST_TYPE* type,
-                            PM_DIAGNOSTIC_RESULT* errorCode, BSTR* additionalInfo) = 0;
+    // Tests in the order of their type, with the texts the event gives for its last test;
+    // E_INVALIDARG for an index outside 0..count-1.
+    virtual HRESULT GetTest(LONG index, PM_DIAGNOSTIC_TEST_TYPE* type, BSTR* typeText,
+                            PM_DIAGNOSTIC_RESULT* errorCode, BSTR* errorText,
+                            BSTR* additionalInfo) = 0;
 };
 
 // Port mappings of the port manager (query it from IAdvancedPortManager).

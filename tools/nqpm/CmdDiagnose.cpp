@@ -1,8 +1,6 @@
 // nqpm diagnose: one diagnostic run through the port manager, as a softphone would ask for it.
 #include <cstdio>
 
-#include "diagnostics/DiagnosticResult.h"
-#include "platform/message.h"
 #include "tools/nqpm/Cli.h"
 #include "tools/nqpm/Commands.h"
 #include "tools/nqpm/ModuleClient.h"
@@ -13,7 +11,7 @@ namespace {
 
 const char* const kUsage =
     "usage: nqpm diagnose --well-known A.B.C.D --stun NAME --echo HOST[:PORT] [--timeout MS]\n"
-    "                     [--json]\n"
+    "                     [--module PATH] [--json]\n"
     "Runs the network diagnostics: the interface and gateway toward the well-known address, the\n"
     "STUN server's name and an answer on UDP port 3478, then a login to the echo server (port\n"
     "default 7) with SIP and media echoes, every wait at most the time-out (default 5000 ms).\n"
@@ -31,7 +29,9 @@ struct Outcome {
     LONG cookie = 0;
     struct Test {
         PM_DIAGNOSTIC_TEST_TYPE type;
+        std::string typeText;
         PM_DIAGNOSTIC_RESULT code;
+        std::string errorText;
         std::string info;
     };
     std::vector<Test> tests;
@@ -76,8 +76,11 @@ class DiagnosticClient final : public _IAdvancedPortManagerEvents {
             tests->get_TestCount(&count);
             for (LONG i = 0; i < count; ++i) {
                 Outcome::Test t{};
-                BStr info;
-                if (SUCCEEDED(tests->GetTest(i, &t.type, &t.code, info.Out()))) {
+                BStr typeText, errorText, info;
+                if (SUCCEEDED(tests->GetTest(i, &t.type, typeText.Out(), &t.code, errorText.Out(),
+                                             info.Out()))) {
+                    t.typeText = typeText.Utf8();
+                    t.errorText = errorText.Utf8();
                     t.info = info.Utf8();
                     outcome.tests.push_back(std::move(t));
                 }
@@ -91,14 +94,14 @@ class DiagnosticClient final : public _IAdvancedPortManagerEvents {
     bool done = false;
 };
 
-Json OutcomeJson(const Outcome& o, const std::vector<std::pair<std::string, std::string>>& texts) {
+Json OutcomeJson(const Outcome& o) {
     Json tests = Json::array();
-    for (size_t i = 0; i < o.tests.size(); ++i) {
-        tests.push_back(Json{{"type", static_cast<int64_t>(o.tests[i].type)},
-                             {"text", texts[i].first},
-                             {"error_code", static_cast<int64_t>(o.tests[i].code)},
-                             {"error_text", texts[i].second},
-                             {"info", o.tests[i].info}});
+    for (const Outcome::Test& t : o.tests) {
+        tests.push_back(Json{{"type", static_cast<int64_t>(t.type)},
+                             {"text", t.typeText},
+                             {"error_code", static_cast<int64_t>(t.code)},
+                             {"error_text", t.errorText},
+                             {"info", t.info}});
     }
     return Json{{"error_code", static_cast<int64_t>(o.code)},
                 {"error_text", o.errorText},
@@ -126,9 +129,7 @@ int RunDiagnose(int argc, char** argv) {
     const std::string stun = options.Required("stun");
     const HostPort echo = ParseHostPort("echo", options.Required("echo"), kDefaultEchoPort);
     const int64_t timeout = options.Has("timeout") ? options.Integer("timeout", 0, 600000) : 5000;
-    ConfigureLogging(options);
     RouteInterrupts();
-
     const ModuleClient module(options.Value("module"));
     ComPtr<IAdvancedPortManager> pm;
     HRESULT hr =
@@ -138,6 +139,7 @@ int RunDiagnose(int argc, char** argv) {
                      static_cast<unsigned>(hr));
         return kExitFailed;
     }
+    module.ConfigureLogging(LogSettingsOf(options), pm.Get());
     DiagnosticClient client;
     ComPtr<IConnectionPoint> point;
     DWORD cookie = 0;
@@ -148,7 +150,6 @@ int RunDiagnose(int argc, char** argv) {
         std::fprintf(stderr, "nqpm: cannot connect to the port manager's events\n");
         return kExitFailed;
     }
-    module.ConfigureLogging(LogSettingsOf(options), pm.Get());
     BStr a(wellKnown), s(stun), e(echo.host);
     hr = pm->DiagnoseNetwork(a.Get(), s.Get(), e.Get(), echo.port, static_cast<LONG>(timeout),
                              kCookie);
@@ -166,24 +167,18 @@ int RunDiagnose(int argc, char** argv) {
         return kExitFailed;
     }
     const Outcome& o = client.outcome;
-    // The map's entries carry codes only; their texts come from the event's own tables.
-    std::vector<std::pair<std::string, std::string>> texts;
-    for (const auto& t : o.tests) {
-        texts.emplace_back(diagnostics::TestTypeText(t.type), diagnostics::ErrorText(t.code));
-    }
     if (options.Json()) {
-        PrintJson(OutcomeJson(o, texts));
+        PrintJson(OutcomeJson(o));
     } else {
         std::printf("error code:      %d (%s)\n", static_cast<int>(o.code), o.errorText.c_str());
         std::printf("test type:       %d (%s)\n", static_cast<int>(o.type), o.typeText.c_str());
         std::printf("additional info: %s\n", o.info.c_str());
         std::printf("cookie:          %ld\n", static_cast<long>(o.cookie));
         std::printf("tests:\n");
-        for (size_t i = 0; i < o.tests.size(); ++i) {
-            std::printf("  %2d %-32s %2d %s%s%s\n", static_cast<int>(o.tests[i].type),
-                        texts[i].first.c_str(), static_cast<int>(o.tests[i].code),
-                        texts[i].second.c_str(), o.tests[i].info.empty() ? "" : " ",
-                        o.tests[i].info.c_str());
+        for (const Outcome::Test& t : o.tests) {
+            std::printf("  %2d %-32s %2d %s%s%s\n", static_cast<int>(t.type), t.typeText.c_str(),
+                        static_cast<int>(t.code), t.errorText.c_str(), t.info.empty() ? "" : " ",
+                        t.info.c_str());
         }
     }
     std::fflush(stdout);

@@ -35,12 +35,36 @@ HRESULT CLocalSipProxy::CreateInstance(REFIID riid, void** ppv) {
 
 CLocalSipProxy::~CLocalSipProxy() = default;
 
+HRESULT CLocalSipProxy::GetRelayCounts(uint64_t* toServer, uint64_t* toClient, uint64_t* dropped) {
+    if (toServer == nullptr || toClient == nullptr || dropped == nullptr) {
+        return E_POINTER;
+    }
+    const RelayCounts counts = Counts();
+    *toServer = counts.toServer;
+    *toClient = counts.toClient;
+    *dropped = counts.dropped;
+    return S_OK;
+}
+
+HRESULT CLocalSipProxy::get_PublicContact(BSTR* pVal) {
+    return portmanager::CopyBstrOut(PublicContact(), pVal);
+}
+
+HRESULT CLocalSipProxy::get_ServerEndpoint(BSTR* pVal) {
+    return portmanager::CopyBstrOut(ServerEndpoint(), pVal);
+}
+
 HRESULT CLocalSipProxy::QueryInterface(REFIID riid, void** ppv) {
     if (ppv == nullptr) {
         return E_POINTER;
     }
     if (riid == IID_IUnknown || riid == IID_IDispatch || riid == IID_ILocalSipProxy) {
         *ppv = static_cast<ILocalSipProxy*>(this);
+        AddRef();
+        return S_OK;
+    }
+    if (riid == IID_ILocalSipProxyStatus) {
+        *ppv = static_cast<ILocalSipProxyStatus*>(this);
         AddRef();
         return S_OK;
     }

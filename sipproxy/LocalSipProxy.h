@@ -28,6 +28,7 @@ struct RelayCounts {
 };
 
 class CLocalSipProxy final : public portmanager::NoTypeInfoDispatch<ILocalSipProxy>,
+                             public ILocalSipProxyStatus,
                              public platform::MessageWindow {
   public:
     // Creates the object (its window included) on the calling thread, which must pump messages
@@ -46,6 +47,11 @@ class CLocalSipProxy final : public portmanager::NoTypeInfoDispatch<ILocalSipPro
     HRESULT Start(IAdvancedPortManager* pPortManager, LONG minPort, LONG maxPort,
                   VARIANT_BOOL vbRandomize) override;
     HRESULT Stop() override;
+
+    // ILocalSipProxyStatus
+    HRESULT GetRelayCounts(uint64_t* toServer, uint64_t* toClient, uint64_t* dropped) override;
+    HRESULT get_PublicContact(BSTR* pVal) override;
+    HRESULT get_ServerEndpoint(BSTR* pVal) override;
 
     platform::LRESULT WindowProc(platform::UINT message, platform::WPARAM wParam,
                                  platform::LPARAM lParam, bool& handled) override;

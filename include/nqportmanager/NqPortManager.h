@@ -130,6 +130,7 @@ inline constexpr IID IID_IPortManagerUpdateEvent = MakeGuid("EE9A8A46-776D-4C9F-
 inline constexpr IID IID_INetworkDiagnosticEvent = MakeGuid("827A1D3A-73BE-45EE-AC32-A5C5707C4D87");
 inline constexpr IID IID_INetworkDiagnosticTests = MakeGuid("72FE03CD-4526-447C-B47A-B84CD778AA06");
 inline constexpr IID IID_ILocalSipProxy = MakeGuid("B9CF6437-54BC-41D7-9F91-4E4CD48CC0DF");
+inline constexpr IID IID_ILocalSipProxyStatus = MakeGuid("5504DEDF-56F2-413D-9D95-C5EB239DAA83");
 // The port-mapping interface answers under two ids that share one implementation.
 inline constexpr IID IID_IPortMappingProvider = MakeGuid("24C284AB-8AEC-462A-B740-0756B3A33D5B");
 inline constexpr IID IID_IPortMappingProvider2 = MakeGuid("23D7AA83-0D64-4643-BAC1-5894837451ED");
@@ -266,8 +267,22 @@ struct ILocalSipProxy : public IDispatch {
     virtual HRESULT Stop() = 0;
 };
 
+// Not part of the Windows component: what a running proxy does, for tools and monitoring. The
+// proxy answers it beside ILocalSipProxy.
+struct ILocalSipProxyStatus : public IUnknown {
+    // The datagrams relayed each way and those dropped since Start.
+    virtual HRESULT GetRelayCounts(uint64_t* toServer, uint64_t* toClient, uint64_t* dropped) = 0;
+    // After a successful Start: the contact the server is to use for the client, and the server.
+    virtual HRESULT get_PublicContact(BSTR* pVal) = 0;
+    virtual HRESULT get_ServerEndpoint(BSTR* pVal) = 0;
+
+  protected:
+    ~ILocalSipProxyStatus() = default;
+};
+
 NQ_DECLARE_COM_IID(IAdvancedPortManager, IID_IAdvancedPortManager);
 NQ_DECLARE_COM_IID(ILocalSipProxy, IID_ILocalSipProxy);
+NQ_DECLARE_COM_IID(ILocalSipProxyStatus, IID_ILocalSipProxyStatus);
 NQ_DECLARE_COM_IID(INqDiagnostics, IID_INqDiagnostics);
 NQ_DECLARE_COM_IID(_IAdvancedPortManagerEvents, DIID__IAdvancedPortManagerEvents);
 NQ_DECLARE_COM_IID(IPortManagerUpdateEvent, IID_IPortManagerUpdateEvent);

@@ -136,9 +136,17 @@ TEST_F(Module, ClassTableFactoriesAndTheLockCount) {
     EXPECT_EQ(proxyFactory->CreateInstance(proxy.Get(), IID_IUnknown,
                                            reinterpret_cast<void**>(&aggregate)),
               CLASS_E_NOAGGREGATION);
+    auto status = proxy.As<ILocalSipProxyStatus>();
+    ASSERT_TRUE(status);
+    uint64_t counts[3] = {9, 9, 9};
+    EXPECT_EQ(status->GetRelayCounts(&counts[0], &counts[1], &counts[2]), S_OK);
+    EXPECT_EQ(counts[0] + counts[1] + counts[2], 0u) << "nothing relayed before Start";
+    EXPECT_EQ(status->GetRelayCounts(nullptr, &counts[1], &counts[2]), E_POINTER);
     proxyFactory.Reset();
     EXPECT_EQ(canUnloadNow_(), S_FALSE) << "a live proxy";
     proxy.Reset();
+    EXPECT_EQ(canUnloadNow_(), S_FALSE) << "its status interface";
+    status.Reset();
     EXPECT_EQ(canUnloadNow_(), S_OK);
 
     factory = Factory();

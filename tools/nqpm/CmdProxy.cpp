@@ -1,10 +1,11 @@
 // nqpm proxy: discovery, a profile for the internal address, and the local SIP proxy relaying
 // until the duration ends or Ctrl-C / SIGTERM.
+#include <cstdint>
 #include <cstdio>
 #include <string>
 #include <vector>
 
-#include "sipproxy/LocalSipProxy.h"
+#include <nqportmanager/NqPortManager.h>
 #include "tools/nqpm/Cli.h"
 #include "tools/nqpm/Commands.h"
 #include "tools/nqpm/Discovery.h"
@@ -97,7 +98,7 @@ int RunProxy(int argc, char** argv) {
     }
 
     ComPtr<ILocalSipProxy> proxy;
-    hr = sipproxy::CLocalSipProxy::CreateInstance(IID_ILocalSipProxy, proxy.GetVoidAddressOf());
+    hr = session.Module().Create(CLSID_LocalSipProxy, IID_ILocalSipProxy, proxy.GetVoidAddressOf());
     if (SUCCEEDED(hr)) {
         BStr internalText(internal);
         hr = proxy->put_InternalAddress(internalText.Get());
@@ -109,17 +110,22 @@ int RunProxy(int argc, char** argv) {
         pm->OnBeforeDisableProfile();
         return Failed(options, "Start", hr);
     }
-    auto* relay = static_cast<sipproxy::CLocalSipProxy*>(proxy.Get());
+    const auto status = proxy.As<ILocalSipProxyStatus>();
     BStr sender;
+    BStr contact;
+    BStr server;
     proxy->get_SenderEndpoint(sender.Out());
+    if (status) {
+        status->get_PublicContact(contact.Out());
+        status->get_ServerEndpoint(server.Out());
+    }
     if (options.Json()) {
         PrintJson(Json{{"sender_endpoint", sender.Utf8()},
-                       {"public_contact", relay->PublicContact()},
-                       {"server", relay->ServerEndpoint()}});
+                       {"public_contact", contact.Utf8()},
+                       {"server", server.Utf8()}});
     } else {
         std::printf("sender endpoint: %s\npublic contact:  %s\nserver:          %s\n",
-                    sender.Utf8().c_str(), relay->PublicContact().c_str(),
-                    relay->ServerEndpoint().c_str());
+                    sender.Utf8().c_str(), contact.Utf8().c_str(), server.Utf8().c_str());
     }
     std::fflush(stdout);
     Progress("relaying; Ctrl-C ends");
@@ -127,16 +133,19 @@ int RunProxy(int argc, char** argv) {
 
     proxy->Stop();
     pm->OnBeforeDisableProfile();
-    const sipproxy::RelayCounts counts = relay->Counts();
+    uint64_t toServer = 0;
+    uint64_t toClient = 0;
+    uint64_t dropped = 0;
+    if (status) {
+        status->GetRelayCounts(&toServer, &toClient, &dropped);
+    }
     if (options.Json()) {
-        PrintJson(Json{{"to_server", counts.toServer},
-                       {"to_client", counts.toClient},
-                       {"dropped", counts.dropped}});
+        PrintJson(Json{{"to_server", toServer}, {"to_client", toClient}, {"dropped", dropped}});
     } else {
         std::printf("relayed to server: %llu\nrelayed to client: %llu\ndropped:           %llu\n",
-                    static_cast<unsigned long long>(counts.toServer),
-                    static_cast<unsigned long long>(counts.toClient),
-                    static_cast<unsigned long long>(counts.dropped));
+                    static_cast<unsigned long long>(toServer),
+                    static_cast<unsigned long long>(toClient),
+                    static_cast<unsigned long long>(dropped));
     }
     return kExitOk;
 }

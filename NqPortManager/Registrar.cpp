@@ -171,16 +171,7 @@ class Parser {
             if (text.size() % 2 != 0) {
                 return Fail("binary value of odd length");
             }
-            for (size_t i = 0; i < text.size(); i += 2) {
-                uint8_t byte = 0;
-                const auto [end, ec] =
-                    std::from_chars(text.data() + i, text.data() + i + 2, byte, 16);
-                if (ec != std::errc() || end != text.data() + i + 2) {
-                    return Fail("'" + text + "' is not hex");
-                }
-                value.bytes.push_back(byte);
-            }
-            return true;
+            return ParseHex(text, value.bytes) || Fail("'" + text + "' is not hex");
         }
         return Fail("unknown value type '" + type + "'");
     }

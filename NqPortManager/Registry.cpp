@@ -1,6 +1,7 @@
 #include "NqPortManager/Registry.h"
 
 #include <cctype>
+#include <charconv>
 #include <nlohmann/json.hpp>
 
 #include "platform/fs.h"
@@ -17,42 +18,12 @@ char Lower(char c) {
     return static_cast<char>(std::tolower(static_cast<unsigned char>(c)));
 }
 
-const char* kHex = "0123456789abcdef";
-
-std::string ToHex(const std::vector<uint8_t>& bytes) {
-    std::string text;
-    for (uint8_t b : bytes) {
-        text += kHex[b >> 4];
-        text += kHex[b & 15];
-    }
-    return text;
-}
-
-bool FromHex(const std::string& text, std::vector<uint8_t>& bytes) {
-    if (text.size() % 2 != 0) {
-        return false;
-    }
-    bytes.clear();
-    for (size_t i = 0; i < text.size(); i += 2) {
-        int value = 0;
-        for (char c : {text[i], text[i + 1]}) {
-            const char* digit = std::char_traits<char>::find(kHex, 16, Lower(c));
-            if (digit == nullptr) {
-                return false;
-            }
-            value = value * 16 + static_cast<int>(digit - kHex);
-        }
-        bytes.push_back(static_cast<uint8_t>(value));
-    }
-    return true;
-}
-
 nlohmann::json ValueToJson(const RegistryValue& v) {
     switch (v.type) {
         case RegistryValue::Type::kDword:
             return {{"d", v.dword}};
         case RegistryValue::Type::kBinary:
-            return {{"b", ToHex(v.bytes)}};
+            return {{"b", HexText(v.bytes)}};
         case RegistryValue::Type::kString:
             break;
     }
@@ -75,7 +46,7 @@ bool ValueFromJson(const nlohmann::json& j, RegistryValue& v) {
         return true;
     }
     v = {RegistryValue::Type::kBinary, "", 0, {}};
-    return type == "b" && data.is_string() && FromHex(data.get<std::string>(), v.bytes);
+    return type == "b" && data.is_string() && ParseHex(data.get<std::string>(), v.bytes);
 }
 
 void AddKeys(const RegistryKey& key, const std::string& path, nlohmann::json& keys) {
@@ -108,6 +79,33 @@ bool SplitPath(const std::string& path, std::vector<std::string>& names) {
 }
 
 }  // namespace
+
+std::string HexText(const std::vector<uint8_t>& bytes) {
+    static constexpr char kHex[] = "0123456789abcdef";
+    std::string text;
+    for (uint8_t b : bytes) {
+        text += kHex[b >> 4];
+        text += kHex[b & 15];
+    }
+    return text;
+}
+
+bool ParseHex(std::string_view text, std::vector<uint8_t>& bytes) {
+    if (text.size() % 2 != 0) {
+        return false;
+    }
+    std::vector<uint8_t> parsed;
+    for (size_t i = 0; i < text.size(); i += 2) {
+        uint8_t byte = 0;
+        const auto [end, ec] = std::from_chars(text.data() + i, text.data() + i + 2, byte, 16);
+        if (ec != std::errc() || end != text.data() + i + 2) {
+            return false;
+        }
+        parsed.push_back(byte);
+    }
+    bytes = std::move(parsed);
+    return true;
+}
 
 bool CaseInsensitiveLess::operator()(std::string_view a, std::string_view b) const {
     const size_t n = std::min(a.size(), b.size());

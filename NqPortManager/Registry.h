@@ -47,6 +47,11 @@ class RegistryKey {
     bool operator==(const RegistryKey&) const = default;
 };
 
+// Binary values as text: two lower-case hex digits a byte; ParseHex takes either case and
+// refuses an odd length or anything but hex digits.
+std::string HexText(const std::vector<uint8_t>& bytes);
+bool ParseHex(std::string_view text, std::vector<uint8_t>& bytes);
+
 // The file's text: JSON with one entry per key and its full path, so that reading it back needs
 // no recursion. False with the reason when a name cannot be written (not UTF-8).
 bool SerializeRegistry(const RegistryKey& root, std::string& text, std::string& error);

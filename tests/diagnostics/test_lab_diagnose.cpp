@@ -88,21 +88,9 @@ struct GatewayNetwork {
     diagnostics::DiagnosticServices services;
 };
 
-// The outer test builds the lab and runs itself inside it, where the body checks.
-#define NQPM_RUN_INSIDE(suite, name, ...)            \
-    if (!testsupport::DnsLab::InsideDnsLab()) {      \
-        testsupport::DnsLab lab(__VA_ARGS__);        \
-        std::string why;                             \
-        if (!lab.Up(&why)) {                         \
-            GTEST_SKIP() << why;                     \
-        }                                            \
-        EXPECT_EQ(lab.RunSelf(#suite "." #name), 0); \
-        return;                                      \
-    }
-
 TEST(LabDiagnoseDns, UnknownNamesWithWorkingDns) {
-    NQPM_RUN_INSIDE(
-        LabDiagnoseDns, UnknownNamesWithWorkingDns,
+    NQPM_RUN_INSIDE_DNS_LAB(
+        "LabDiagnoseDns.UnknownNamesWithWorkingDns",
         std::vector<std::string>{std::string(diagnostics::kPublicHostName) + ",127.0.0.53"})
     GatewayNetwork network;
     const std::string unknown = testsupport::DnsLab::kUnknownName;
@@ -133,7 +121,7 @@ TEST(LabDiagnoseDns, UnknownNamesWithWorkingDns) {
 }
 
 TEST(LabDiagnoseDns, NoNameResolves) {
-    NQPM_RUN_INSIDE(LabDiagnoseDns, NoNameResolves, std::vector<std::string>{})
+    NQPM_RUN_INSIDE_DNS_LAB("LabDiagnoseDns.NoNameResolves", std::vector<std::string>{})
     GatewayNetwork network;
     const DiagnosticResult r = RunSequence("192.0.2.1", testsupport::DnsLab::kUnknownName,
                                            "127.0.0.1", 7000, network.services);
@@ -148,8 +136,8 @@ TEST(LabDiagnoseDns, ShutdownEndsARunWaitingForASilentNameServer) {
     GTEST_SKIP() << "ThreadSanitizer builds resolve without interruption (the resolver's own "
                     "threads are invisible to it)";
 #endif
-    NQPM_RUN_INSIDE(LabDiagnoseDns, ShutdownEndsARunWaitingForASilentNameServer,
-                    std::vector<std::string>{}, false)
+    NQPM_RUN_INSIDE_DNS_LAB("LabDiagnoseDns.ShutdownEndsARunWaitingForASilentNameServer",
+                            std::vector<std::string>{}, false)
     // The name server: receives the question and never answers.
     platform::Socket silent = platform::OpenUdpSocket();
     ASSERT_TRUE(platform::BindSocket(silent.Get(), 0x7F000001, 53));

@@ -267,15 +267,7 @@ class LabProxyDns : public ProxyFixture {
 };
 
 TEST_F(LabProxyDns, UnresolvableServerGivesEFailAndStartsNoThread) {
-    if (!testsupport::DnsLab::InsideDnsLab()) {
-        testsupport::DnsLab lab;
-        std::string why;
-        if (!lab.Up(&why)) {
-            GTEST_SKIP() << why;
-        }
-        EXPECT_EQ(lab.RunSelf("LabProxyDns.UnresolvableServerGivesEFailAndStartsNoThread"), 0);
-        return;
-    }
+    NQPM_RUN_INSIDE_DNS_LAB("LabProxyDns.UnresolvableServerGivesEFailAndStartsNoThread")
     SetUpPortManager(std::string(testsupport::DnsLab::kUnknownName) + ":5070");
     ASSERT_EQ(sipproxy::CLocalSipProxy::CreateInstance(IID_ILocalSipProxy,
                                                        reinterpret_cast<void**>(&proxy)),

@@ -109,15 +109,7 @@ TEST(STUNTestServers, AddressZeroCountsAsAFailedServer) {
 namespace {
 
 TEST(LabDnsTestServers, UnresolvableNamesAreSkippedAndOnlyThoseGiveMinusOne) {
-    if (!testsupport::DnsLab::InsideDnsLab()) {
-        testsupport::DnsLab lab;
-        std::string why;
-        if (!lab.Up(&why)) {
-            GTEST_SKIP() << why;
-        }
-        EXPECT_EQ(lab.RunSelf("LabDnsTestServers.*"), 0);
-        return;
-    }
+    NQPM_RUN_INSIDE_DNS_LAB("LabDnsTestServers.*")
     const std::string unknown = testsupport::DnsLab::kUnknownName;
     EXPECT_EQ(stun::STUN_TestServers(kLocal, (unknown + "," + unknown).c_str()), -1);
     // stun.lab.test is 127.0.0.1: a server there on 3478 is chosen after the unknown name.

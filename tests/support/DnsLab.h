@@ -40,3 +40,17 @@ class DnsLab {
 };
 
 }  // namespace testsupport
+
+// The first lines of a test that runs inside a DnsLab: outside, it builds the lab (the macro's
+// further arguments go to its constructor), runs `testName` (a --gtest_filter pattern) in it and
+// returns; inside, the test's body goes on.
+#define NQPM_RUN_INSIDE_DNS_LAB(testName, ...)    \
+    if (!testsupport::DnsLab::InsideDnsLab()) {   \
+        testsupport::DnsLab dnsLab_{__VA_ARGS__}; \
+        std::string whyNot_;                      \
+        if (!dnsLab_.Up(&whyNot_)) {              \
+            GTEST_SKIP() << whyNot_;              \
+        }                                         \
+        EXPECT_EQ(dnsLab_.RunSelf(testName), 0);  \
+        return;                                   \
+    }

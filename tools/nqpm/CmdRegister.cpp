@@ -10,6 +10,7 @@
 #include "platform/module.h"
 #include "tools/nqpm/Cli.h"
 #include "tools/nqpm/Commands.h"
+#include "tools/nqpm/ModuleClient.h"
 
 namespace nqpm {
 
@@ -29,15 +30,8 @@ std::string ValueText(const registry::RegistryValue& v) {
     switch (v.type) {
         case registry::RegistryValue::Type::kDword:
             return "d '" + std::to_string(v.dword) + "'";
-        case registry::RegistryValue::Type::kBinary: {
-            std::string hex = "b '";
-            for (uint8_t b : v.bytes) {
-                static const char kHex[] = "0123456789abcdef";
-                hex += kHex[b >> 4];
-                hex += kHex[b & 15];
-            }
-            return hex + "'";
-        }
+        case registry::RegistryValue::Type::kBinary:
+            return "b '" + registry::HexText(v.bytes) + "'";
         case registry::RegistryValue::Type::kString:
             break;
     }
@@ -63,12 +57,6 @@ void PrintKeys(const registry::RegistryKey& key, const std::string& path, Json* 
     }
 }
 
-std::string DefaultModulePath() {
-    const std::string self = platform::ModuleFilePath(reinterpret_cast<const void*>(&PrintKeys));
-    const std::string bin = self.substr(0, self.find_last_of('/') + 1);
-    return bin + "../lib/libNqPortManager.so";
-}
-
 int RunRegistration(int argc, char** argv, bool registering) {
     const char* name = registering ? "register" : "unregister";
     Options options(name, {{"module", true}, {"registry", true}}, kRegisterUsage);
@@ -80,7 +68,7 @@ int RunRegistration(int argc, char** argv, bool registering) {
     if (options.Has("registry")) {
         platform::SetEnvironmentValue("NQPM_REGISTRY", options.Value("registry"));
     }
-    const std::string path = options.Has("module") ? options.Value("module") : DefaultModulePath();
+    const std::string path = options.Has("module") ? options.Value("module") : ModuleBesideNqpm();
     std::string error;
     void* module = platform::LoadModule(path, error);
     const auto entry = reinterpret_cast<HRESULT (*)()>(

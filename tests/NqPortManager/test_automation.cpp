@@ -437,6 +437,54 @@ TEST(AutomationInvoke, FailingMemberGivesDispExceptionWithItsErrorInfo) {
     }
 }
 
+TEST(AutomationVariant, ChangeTypeConvertsTheTypesUsedHereAndRefusesTheRest) {
+    struct Case {
+        VARIANT from;
+        USHORT flags;
+        VARTYPE to;
+        HRESULT hr;
+        std::string text;  // the result as a BSTR when to is VT_BSTR, else its lVal or boolVal
+    };
+    VARIANT flag = Of(VT_BOOL);
+    flag.boolVal = VARIANT_TRUE;
+    const Case cases[] = {
+        {I4(-7), 0, VT_BSTR, S_OK, "-7"},
+        {flag, 0, VT_BSTR, S_OK, "-1"},
+        {flag, VARIANT_ALPHABOOL, VT_BSTR, S_OK, "True"},
+        {Of(VT_EMPTY), 0, VT_BSTR, S_OK, ""},
+        {I4(70000), 0, VT_I2, DISP_E_OVERFLOW, ""},
+        {I4(-1), 0, VT_UI4, DISP_E_OVERFLOW, ""},
+        {I4(2), 0, VT_BOOL, S_OK, "-1"},
+        {Of(VT_ERROR), 0, VT_I4, DISP_E_TYPEMISMATCH, ""},
+        {I4(1), 0, VT_UNKNOWN, DISP_E_TYPEMISMATCH, ""},
+        {I4(1), 0, VT_I4 | VT_BYREF, DISP_E_BADVARTYPE, ""},
+    };
+    for (const Case& c : cases) {
+        VARIANT out;
+        VariantInit(&out);
+        EXPECT_EQ(VariantChangeType(&out, &c.from, c.flags, c.to), c.hr) << c.text;
+        if (SUCCEEDED(c.hr)) {
+            EXPECT_EQ(c.to == VT_BSTR   ? Utf8FromBstr(out.bstrVal)
+                      : c.to == VT_BOOL ? std::to_string(out.boolVal)
+                                        : std::to_string(out.lVal),
+                      c.text);
+        }
+        EXPECT_EQ(out.vt, SUCCEEDED(c.hr) ? c.to : VARTYPE{VT_EMPTY});
+        VariantClear(&out);
+    }
+    // In place, and through a reference.
+    VARIANT v = Str(u" 12 ");
+    EXPECT_EQ(VariantChangeType(&v, &v, 0, VT_I4), S_OK);
+    EXPECT_EQ(v.vt, VT_I4);
+    LONG value = 5;
+    VARIANT ref = Of(VT_I4 | VT_BYREF);
+    ref.byref = &value;
+    EXPECT_EQ(VariantChangeType(&v, &ref, 0, VT_BSTR), S_OK);
+    EXPECT_EQ(Utf8FromBstr(v.bstrVal), "5");
+    VariantClear(&v);
+    EXPECT_EQ(VariantChangeType(nullptr, &ref, 0, VT_I4), E_INVALIDARG);
+}
+
 TEST_F(Automation, TypeInfoWalkGivesTheEnumerationsAndTheLibrary) {
     struct Expected {
         const char* name;

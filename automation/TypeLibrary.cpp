@@ -1,6 +1,7 @@
 // ITypeLib and ITypeInfo over a LibraryDesc: one library object and one type info per type, all
 // living as long as the module; their references only lock the module.
 #include <atomic>
+#include <cstdint>
 #include <memory>
 #include <new>
 #include <string>
@@ -17,6 +18,11 @@ namespace {
 // Enumeration constants get ids of their own, apart from the DISPIDs of members.
 constexpr MEMBERID kConstantBase = 0x40000000;
 constexpr size_t kMaxParams = 16;
+
+// The index of an enumeration constant's id; SIZE_MAX for any other id.
+size_t ConstantIndex(MEMBERID memid) {
+    return memid >= kConstantBase ? static_cast<size_t>(memid - kConstantBase) : SIZE_MAX;
+}
 
 bool SameName(const char* name, std::u16string_view text) {
     size_t i = 0;
@@ -408,8 +414,8 @@ HRESULT TypeInfo::GetNames(MEMBERID memid, BSTR* rgBstrNames, UINT cMaxNames, UI
     }
     *pcNames = 0;
     std::vector<const char*> names;
-    const size_t constant = static_cast<size_t>(memid - kConstantBase);
-    if (memid >= kConstantBase && constant < m_type.values.size()) {
+    const size_t constant = ConstantIndex(memid);
+    if (constant < m_type.values.size()) {
         names.push_back(m_type.values[constant].name);
     }
     for (const MemberDesc& m : m_type.members) {
@@ -513,8 +519,8 @@ HRESULT TypeInfo::GetDocumentation(MEMBERID memid, BSTR* pBstrName, BSTR* pBstrD
         name = m_type.name;
         doc = m_type.doc;
     }
-    const size_t constant = static_cast<size_t>(memid - kConstantBase);
-    if (memid >= kConstantBase && constant < m_type.values.size()) {
+    const size_t constant = ConstantIndex(memid);
+    if (constant < m_type.values.size()) {
         name = m_type.values[constant].name;
     }
     for (const MemberDesc& m : m_type.members) {

@@ -339,8 +339,16 @@ HRESULT VariantChangeType(VARIANTARG* pvargDest, const VARIANTARG* pvarSrc, USHO
         if (src.byref == nullptr) {
             return E_INVALIDARG;
         }
+        if ((src.vt & VT_ARRAY) != 0) {
+            return DISP_E_TYPEMISMATCH;
+        }
         if (base == VT_VARIANT) {
-            return VariantChangeType(pvargDest, static_cast<VARIANT*>(src.byref), wFlags, vt);
+            // One level only, as on Windows: a reference to a reference is no valid VARIANT.
+            const auto* inner = static_cast<const VARIANT*>(src.byref);
+            if (inner->vt == (VT_BYREF | VT_VARIANT)) {
+                return DISP_E_BADVARTYPE;
+            }
+            return VariantChangeType(pvargDest, inner, wFlags, vt);
         }
         VARIANT deref;
         VariantInit(&deref);

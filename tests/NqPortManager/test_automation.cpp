@@ -563,6 +563,18 @@ TEST_F(Automation, TypeInfoWalkGivesTheEnumerationsAndTheLibrary) {
     EXPECT_EQ(flags, IMPLTYPEFLAG_FDEFAULT | IMPLTYPEFLAG_FSOURCE);
     EXPECT_EQ(library_->GetTypeInfoOfGuid(GUID_NULL, coclass.GetAddressOf()),
               TYPE_E_ELEMENTNOTFOUND);
+    VARDESC* var = nullptr;
+    EXPECT_EQ(pm->GetFuncDesc(22, &func), TYPE_E_ELEMENTNOTFOUND);
+    EXPECT_EQ(pm->GetVarDesc(0, &var), TYPE_E_ELEMENTNOTFOUND);
+    EXPECT_EQ(pm->GetTypeAttr(nullptr), E_INVALIDARG);
+    EXPECT_EQ(state->Invoke(pm.Get(), 0, DISPATCH_METHOD, nullptr, nullptr, nullptr, nullptr),
+              E_INVALIDARG);  // an enumeration has nothing to call
+    ITypeLib* other = nullptr;
+    EXPECT_EQ(LoadRegTypeLib(LIBID_NqPortManagerLib, 2, 0, 0, &other), TYPE_E_LIBNOTREGISTERED);
+    EXPECT_EQ(LoadRegTypeLib(GUID_NULL, 1, 0, 0, &other), TYPE_E_LIBNOTREGISTERED);
+    EXPECT_EQ(LoadRegTypeLib(LIBID_NqPortManagerLib, 1, 0, 0xFFFFFFFF, &other),
+              TYPE_E_LIBNOTREGISTERED);
+    EXPECT_EQ(other, nullptr);
 }
 
 }  // namespace

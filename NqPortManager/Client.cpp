@@ -39,6 +39,7 @@ HRESULT Module::Load(const std::string& path, Module& module, std::string* error
     loaded.m_path = path;
     Find(handle, "DllGetClassObject", loaded.m_getClassObject);
     Find(handle, "DllCanUnloadNow", loaded.m_canUnloadNow);
+    Find(handle, "LoadRegTypeLib", loaded.m_loadTypeLib);
     Find(handle, "NqMessageQueueDescriptor", loaded.m_queueDescriptor);
     Find(handle, "NqPumpPendingMessages", loaded.m_pump);
     Find(handle, "NqRunMessageLoopUntil", loaded.m_runUntil);
@@ -105,6 +106,16 @@ bool Module::Unload() {
 
 void* Module::Symbol(const char* name) const {
     return platform::ModuleSymbol(m_handle, name);
+}
+
+HRESULT Module::LoadTypeLibrary(ITypeLib** library) const {
+    if (library == nullptr) {
+        return E_POINTER;
+    }
+    *library = nullptr;
+    return m_loadTypeLib != nullptr
+               ? m_loadTypeLib(LIBID_NqPortManagerLib, 1, 0, LOCALE_NEUTRAL, library)
+               : E_NOTIMPL;
 }
 
 int Module::MessageQueueDescriptor() const {

@@ -6,6 +6,7 @@
 
 #include "NqPortManager/Registration.h"
 #include "NqPortManager/Registry.h"
+#include "automation/NqPortManagerLib.h"
 #include "foundation/Logger.h"
 #include "platform/module.h"
 #include "platform/modulelock.h"
@@ -17,14 +18,16 @@ namespace {
 using Creator = HRESULT (*)(IUnknown* outer, REFIID riid, void** ppv);
 
 HRESULT CreatePortManager(IUnknown* outer, REFIID riid, void** ppv) {
-    return portmanager::CAdvancedPortManager::CreateInstance(outer, riid, ppv);
+    portmanager::PortManagerServices services = portmanager::PortManagerServices::Default();
+    services.typeLibrary = automation::NqPortManagerTypeLib();
+    return portmanager::CAdvancedPortManager::CreateInstance(outer, riid, ppv, std::move(services));
 }
 
 HRESULT CreateSipProxy(IUnknown* outer, REFIID riid, void** ppv) {
     if (outer != nullptr) {
         return CLASS_E_NOAGGREGATION;
     }
-    return sipproxy::CLocalSipProxy::CreateInstance(riid, ppv);
+    return sipproxy::CLocalSipProxy::CreateInstance(riid, ppv, automation::NqPortManagerTypeLib());
 }
 
 // One per creatable class, for the module's lifetime. A reference held by a client locks the

@@ -4,6 +4,7 @@
 
 #include "NqPortManager/Registrar.h"
 #include "NqPortManager/Registry.h"
+#include "automation/NqPortManagerLib.h"
 
 namespace registry {
 
@@ -55,7 +56,7 @@ const char kTypeLibScript[] = R"(HKCR
     {
         ForceRemove %LIBID%
         {
-            1.0 = s 'NqPortManager 1.0 Type Library'
+            %LIBVERSION% = s '%LIBHELP%'
             {
                 0
                 {
@@ -87,11 +88,15 @@ HRESULT UpdateRegistration(bool registering, const std::vector<RegisteredClass>&
                            const std::string& modulePath, const std::string& registryPath,
                            std::string& error) {
     const std::string folder = modulePath.substr(0, modulePath.find_last_of('/') + 1);
+    const automation::LibraryDesc& library = automation::NqPortManagerLibrary();
     std::map<std::string, std::string> replacements = {
         {"MODULE", modulePath},
         {"MODULEDIR", folder.empty() ? "." : folder},
         {"APPID", GuidToString(APPID_NqPortManager)},
-        {"LIBID", GuidToString(LIBID_NqPortManagerLib)},
+        {"LIBID", GuidToString(*library.guid)},
+        {"LIBVERSION",
+         std::to_string(library.majorVersion) + "." + std::to_string(library.minorVersion)},
+        {"LIBHELP", library.doc},
     };
     HRESULT result = S_OK;
     const auto edit = [&](RegistryKey& root, std::string& why) {

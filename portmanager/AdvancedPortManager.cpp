@@ -57,6 +57,7 @@ CAdvancedPortManager::CAdvancedPortManager(PortManagerServices services, IUnknow
       m_services(std::move(services)),
       m_upnpDetector(*m_services.upnpProbe),
       m_monitor(*m_services.networkInfo) {
+    UseTypeLibrary(m_services.typeLibrary);
     ResetToDefaults();
 }
 

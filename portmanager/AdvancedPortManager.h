@@ -50,6 +50,8 @@ struct PortManagerServices {
                                                      platform::UINT, platform::WPARAM,
                                                      platform::NetworkInfo&)>
         createStunService;
+    // The type information IDispatch is served from (the module's library); null: none.
+    ITypeLib* typeLibrary = nullptr;
 
     static PortManagerServices Default();
 };
@@ -61,7 +63,7 @@ struct PortManagerServices {
 class CAdvancedPortManager final : public ISupportErrorInfo,
                                    public IConnectionPointContainer,
                                    public IConnectionPoint,
-                                   public NoTypeInfoDispatch<IAdvancedPortManager>,
+                                   public TypeInfoDispatch<IAdvancedPortManager>,
                                    public IPortMappingProvider,
                                    public platform::MessageWindow,
                                    public INqDiagnostics,

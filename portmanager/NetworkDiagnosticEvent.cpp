@@ -8,7 +8,7 @@
 namespace portmanager {
 
 HRESULT NetworkDiagnosticEvent::Create(const diagnostics::DiagnosticResult& result, LONG cookie,
-                                       INetworkDiagnosticEvent** event) {
+                                       INetworkDiagnosticEvent** event, ITypeLib* library) {
     if (event == nullptr) {
         return E_POINTER;
     }
@@ -17,6 +17,7 @@ HRESULT NetworkDiagnosticEvent::Create(const diagnostics::DiagnosticResult& resu
         *event = nullptr;
         return E_OUTOFMEMORY;
     }
+    created->UseTypeLibrary(library);
     created->AddRef();
     *event = created;
     return S_OK;

@@ -12,12 +12,13 @@
 
 namespace portmanager {
 
-class NetworkDiagnosticEvent final : public NoTypeInfoDispatch<INetworkDiagnosticEvent>,
+class NetworkDiagnosticEvent final : public TypeInfoDispatch<INetworkDiagnosticEvent>,
                                      public INetworkDiagnosticTests {
   public:
-    // A new event holding a copy of result, with one reference held by the caller.
+    // A new event holding a copy of result, with one reference held by the caller, its IDispatch
+    // served from library.
     static HRESULT Create(const diagnostics::DiagnosticResult& result, LONG cookie,
-                          INetworkDiagnosticEvent** event);
+                          INetworkDiagnosticEvent** event, ITypeLib* library = nullptr);
 
     HRESULT QueryInterface(REFIID riid, void** ppv) override;
     ULONG AddRef() override;

@@ -46,7 +46,7 @@ void CAdvancedPortManager::OnDiagnosticComplete(platform::WPARAM wParam) {
     ComPtr<INetworkDiagnosticEvent> event;
     ComPtr<IDispatch> dispatch;
     if (FAILED(NetworkDiagnosticEvent::Create(outcome->m_result, outcome->m_cookie,
-                                              event.GetAddressOf())) ||
+                                              event.GetAddressOf(), m_services.typeLibrary)) ||
         FAILED(event.As(&dispatch))) {
         return;
     }

@@ -4,7 +4,7 @@
 
 namespace portmanager {
 
-HRESULT PortManagerUpdateEvent::Create(IPortManagerUpdateEvent** event) {
+HRESULT PortManagerUpdateEvent::Create(IPortManagerUpdateEvent** event, ITypeLib* library) {
     if (event == nullptr) {
         return E_POINTER;
     }
@@ -13,6 +13,7 @@ HRESULT PortManagerUpdateEvent::Create(IPortManagerUpdateEvent** event) {
         *event = nullptr;
         return E_OUTOFMEMORY;
     }
+    created->UseTypeLibrary(library);
     created->AddRef();
     *event = created;
     return S_OK;

@@ -12,10 +12,10 @@
 
 namespace portmanager {
 
-class PortManagerUpdateEvent final : public NoTypeInfoDispatch<IPortManagerUpdateEvent> {
+class PortManagerUpdateEvent final : public TypeInfoDispatch<IPortManagerUpdateEvent> {
   public:
-    // A new event with one reference held by the caller.
-    static HRESULT Create(IPortManagerUpdateEvent** event);
+    // A new event with one reference held by the caller, its IDispatch served from library.
+    static HRESULT Create(IPortManagerUpdateEvent** event, ITypeLib* library = nullptr);
 
     HRESULT QueryInterface(REFIID riid, void** ppv) override;
     ULONG AddRef() override;

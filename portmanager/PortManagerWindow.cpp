@@ -56,7 +56,7 @@ void CAdvancedPortManager::NotifyChange(PM_EVENT type) {
     NQ_TRACE_ENTERED("CAdvancedPortManager::NotifyChange");
     ComPtr<IPortManagerUpdateEvent> event;
     ComPtr<IDispatch> dispatch;
-    if (FAILED(PortManagerUpdateEvent::Create(event.GetAddressOf())) ||
+    if (FAILED(PortManagerUpdateEvent::Create(event.GetAddressOf(), m_services.typeLibrary)) ||
         FAILED(event->put_PortManager(this)) || FAILED(event.As(&dispatch))) {
         return;
     }

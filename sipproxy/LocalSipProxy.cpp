@@ -15,7 +15,7 @@ constexpr const char* kReceiver = "CLocalSipProxy::ReceiverServiceProc";
 constexpr const char* kSendFailed = "Send(%s, %d) failed";
 }  // namespace
 
-HRESULT CLocalSipProxy::CreateInstance(REFIID riid, void** ppv) {
+HRESULT CLocalSipProxy::CreateInstance(REFIID riid, void** ppv, ITypeLib* library) {
     if (ppv == nullptr) {
         return E_POINTER;
     }
@@ -24,6 +24,7 @@ HRESULT CLocalSipProxy::CreateInstance(REFIID riid, void** ppv) {
     if (object == nullptr) {
         return E_OUTOFMEMORY;
     }
+    object->UseTypeLibrary(library);
     object->AddRef();  // keeps it alive through a failed construction or query
     HRESULT hr = object->CreateMessageWindow() ? S_OK : E_FAIL;
     if (SUCCEEDED(hr)) {

@@ -27,13 +27,14 @@ struct RelayCounts {
     uint64_t dropped = 0;
 };
 
-class CLocalSipProxy final : public portmanager::NoTypeInfoDispatch<ILocalSipProxy>,
+class CLocalSipProxy final : public portmanager::TypeInfoDispatch<ILocalSipProxy>,
                              public ILocalSipProxyStatus,
                              public platform::MessageWindow {
   public:
     // Creates the object (its window included) on the calling thread, which must pump messages
     // for the keep-alive. E_FAIL when the window cannot be created.
-    static HRESULT CreateInstance(REFIID riid, void** ppv);
+    // Its IDispatch is served from library (none: no members).
+    static HRESULT CreateInstance(REFIID riid, void** ppv, ITypeLib* library = nullptr);
 
     // IUnknown
     HRESULT QueryInterface(REFIID riid, void** ppv) override;

@@ -13,6 +13,7 @@
 #include <nqportmanager/ComPtr.h>
 #include <nqportmanager/com.h>
 #include <nqportmanager/messageloop.h>
+#include <nqportmanager/typeinfo.h>
 
 enum PM_STATE : int32_t {
     PMS_UNINITIALIZED = 0,

@@ -26,6 +26,8 @@ class Module {
 
     HRESULT CreateInstance(REFCLSID clsid, IUnknown* outer, REFIID riid, void** ppv) const;
     HRESULT CanUnloadNow() const;
+    // The module's type library (its LoadRegTypeLib); E_NOTIMPL for a module without one.
+    HRESULT LoadTypeLibrary(ITypeLib** library) const;
     bool Unload();
     bool IsLoaded() const { return m_handle != nullptr; }
     const std::string& Path() const { return m_path; }
@@ -49,6 +51,7 @@ class Module {
     std::string m_path;
     HRESULT (*m_getClassObject)(REFCLSID, REFIID, void**) = nullptr;
     HRESULT (*m_canUnloadNow)() = nullptr;
+    HRESULT (*m_loadTypeLib)(REFGUID, WORD, WORD, LCID, ITypeLib**) = nullptr;
     int (*m_queueDescriptor)() = nullptr;
     int (*m_pump)() = nullptr;
     int (*m_runUntil)(int (*)(void*), void*, int) = nullptr;

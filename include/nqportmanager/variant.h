@@ -21,10 +21,17 @@ enum VARENUM {
     VT_UI4 = 19,
     VT_INT = 22,
     VT_UINT = 23,
+    VT_VOID = 24,
+    VT_HRESULT = 25,
+    VT_PTR = 26,
+    VT_USERDEFINED = 29,
     VT_ARRAY = 0x2000,
     VT_BYREF = 0x4000,
     VT_TYPEMASK = 0x0FFF,
 };
+
+// VariantChangeType: VT_BOOL to VT_BSTR as "True"/"False" instead of "-1"/"0".
+inline constexpr USHORT VARIANT_ALPHABOOL = 0x2;
 
 struct VARIANT {
     VARTYPE vt;
@@ -70,4 +77,10 @@ extern "C" {
 NQ_MODULE_EXPORT void VariantInit(VARIANTARG* pvarg);
 NQ_MODULE_EXPORT HRESULT VariantClear(VARIANTARG* pvarg);
 NQ_MODULE_EXPORT HRESULT VariantCopy(VARIANTARG* pvargDest, const VARIANTARG* pvargSrc);
+// Conversion among VT_EMPTY, the integer types, VT_BOOL, VT_BSTR (decimal integers, "True" and
+// "False"), VT_UNKNOWN and VT_DISPATCH (by QueryInterface), through VT_BYREF too. Numbers out of
+// the target's range give DISP_E_OVERFLOW, anything else that cannot be converted
+// DISP_E_TYPEMISMATCH. pvargDest may be pvarSrc; it is changed only on success.
+NQ_MODULE_EXPORT HRESULT VariantChangeType(VARIANTARG* pvargDest, const VARIANTARG* pvarSrc,
+                                           USHORT wFlags, VARTYPE vt);
 }  // extern "C"

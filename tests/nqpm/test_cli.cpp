@@ -217,4 +217,26 @@ TEST(NqpmRegistry, RegisterPrintsTheClassAndUnregisterLeavesTheSharedKeys) {
     std::remove(file.c_str());
 }
 
+TEST(NqpmAutomation, TypeinfoPrintsTheLibraryAndInvokeCallsMembersByName) {
+    const NqpmRun types = RunNqpm({"typeinfo", "--json"});
+    ASSERT_EQ(types.code, 0) << types.err;
+    const nlohmann::json library = ParseJson(types.out);
+    EXPECT_EQ(library["library"]["help"], "NqPortManager 1.0 Type Library");
+    ASSERT_EQ(library["types"].size(), 14u);
+    const nlohmann::json& state = library["types"][5]["members"][5];  // IAdvancedPortManager
+    EXPECT_EQ(state["name"], "State");
+    EXPECT_EQ(state["params"][0]["type"], "PM_STATE*");
+
+    const std::string file = ::testing::TempDir() + "nqpm-invoke-" +
+                             std::to_string(platform::testing::CurrentProcessId()) + ".json";
+    ASSERT_EQ(RunNqpm({"register", "--registry", file}).code, 0);
+    const NqpmRun calls =
+        RunNqpm({"invoke", "--registry", file, "--json", "NqPortManager.AdvancedPortManager",
+                 "State", ";", "ErrorCanBeDiagnosed", "x"});
+    EXPECT_EQ(calls.code, 1);
+    EXPECT_EQ(ParseJson(calls.out)["result"]["name"], "PMS_UNINITIALIZED") << calls.out;
+    EXPECT_NE(calls.err.find("0x80020005"), std::string::npos) << calls.err;
+    std::remove(file.c_str());
+}
+
 }  // namespace

@@ -17,6 +17,8 @@ int RunUnregister(int argc, char** argv);
 int RunRegistry(int argc, char** argv);
 int RunDiagnose(int argc, char** argv);
 int RunProxy(int argc, char** argv);
+int RunTypeinfo(int argc, char** argv);
+int RunInvoke(int argc, char** argv);
 
 // {"results":[{"local":..,"result":..,"code":..,"public":..|null}],"text":..}
 Json ClassificationJson(const stun::STUNResultList& list);

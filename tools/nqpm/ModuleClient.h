@@ -31,6 +31,7 @@ class ModuleClient {
     explicit ModuleClient(const std::string& modulePath);
 
     HRESULT Create(REFCLSID clsid, REFIID riid, void** ppv) const;
+    HRESULT LoadTypeLibrary(ITypeLib** library) const { return m_module.LoadTypeLibrary(library); }
     // nqpm's loop, serving the module's queue too, until done(), the timeout (-1: none) or an
     // interrupt. Returns done().
     bool RunUntil(const std::function<bool()>& done, int timeoutMs) const;

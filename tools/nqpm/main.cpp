@@ -23,6 +23,8 @@ const Command kCommands[] = {
     {"monitor", nqpm::RunMonitor, "local addresses, then every address or route change"},
     {"proxy", nqpm::RunProxy, "relay SIP through the local proxy behind the NAT"},
     {"diagnose", nqpm::RunDiagnose, "interface, DNS, STUN and echo server tests"},
+    {"typeinfo", nqpm::RunTypeinfo, "the module's type library, from its type information"},
+    {"invoke", nqpm::RunInvoke, "call members of an object by name through IDispatch"},
     {"register", nqpm::RunRegister, "register the module in the registry file"},
     {"unregister", nqpm::RunUnregister, "remove the module's registration"},
     {"registry", nqpm::RunRegistry, "print the keys of the registry file"},

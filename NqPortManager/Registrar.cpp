@@ -107,6 +107,10 @@ class Parser {
             if (!Name(key.name)) {
                 return false;
             }
+            // The file keeps keys by their backslash-separated path.
+            if (key.name.find('\\') != std::string::npos) {
+                return Fail("a backslash in the key name '" + key.name + "'");
+            }
             if (token_.kind == Token::Kind::kEquals) {
                 Next();
                 if (!Value(key.defaultValue.emplace())) {

@@ -168,7 +168,8 @@ bool SerializeRegistry(const RegistryKey& root, std::string& text, std::string& 
 
 bool ParseRegistry(const std::string& text, RegistryKey& root, std::string& error) {
     const nlohmann::json j = nlohmann::json::parse(text, nullptr, false);
-    if (j.is_discarded() || !j.is_object() || j.value("format", "") != kFormat ||
+    // Compared, never converted: a field of another type is a bad file, not an exception.
+    if (j.is_discarded() || !j.is_object() || !j.contains("format") || j["format"] != kFormat ||
         !j.contains("version") || j["version"] != kVersion || !j.contains("keys") ||
         !j["keys"].is_array()) {
         error = "not a registry file of this version";

@@ -5,7 +5,7 @@ NQPM_ROOT=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
 
 # Debian packages the build, the tests and the demo need.
 NQPM_PACKAGES=(
-    cmake g++ make pkg-config git
+    cmake g++ make pkg-config git clang libclang-rt-dev
     googletest libgtest-dev libbenchmark-dev clang-format nlohmann-json3-dev
     iproute2 nftables procps
     stun-server stun-client

@@ -262,21 +262,6 @@ class LabNetworkChangeMonitor : public ::testing::Test {
     std::optional<CNetworkChangeMonitor> monitor_;
 };
 
-TEST_F(LabNetworkChangeMonitor, ListsOnlyTheFirstAddressOfInterfacesWithADefaultGateway) {
-    monitor_->RefreshLocalIPs();
-    EXPECT_TRUE(monitor_->GetLocalIPs().empty()) << "loopback only";
-
-    ASSERT_TRUE(IpCommand("addr add 10.99.0.10/24 dev v0"));
-    ASSERT_TRUE(IpCommand("addr add 10.98.0.20/24 dev v1"));
-    monitor_->RefreshLocalIPs();
-    EXPECT_TRUE(monitor_->GetLocalIPs().empty()) << "no default route";
-
-    ASSERT_TRUE(IpCommand("addr add 10.99.0.11/24 dev v0"));
-    ASSERT_TRUE(IpCommand("route add default via 10.99.0.1"));
-    monitor_->RefreshLocalIPs();
-    EXPECT_EQ(monitor_->GetLocalIPs(), Addresses{Ip(10, 99, 0, 10)});
-}
-
 TEST_F(LabNetworkChangeMonitor, OnePassPerNotificationOverEverySinkAndStopInThePauseEndsIt) {
     ASSERT_TRUE(AddDefaultRoute());
     auto& monitor = *monitor_;

@@ -103,6 +103,10 @@ bool Module::Unload() {
     return unloaded;
 }
 
+void* Module::Symbol(const char* name) const {
+    return platform::ModuleSymbol(m_handle, name);
+}
+
 int Module::MessageQueueDescriptor() const {
     return m_queueDescriptor != nullptr ? m_queueDescriptor() : -1;
 }

@@ -1,10 +1,13 @@
 #include "foundation/Logger.h"
 
+#include <atomic>
 #include <cstdarg>
+#include <memory>
 #include <vector>
 
 #include "platform/fs.h"
 #include "platform/kernel.h"
+#include "platform/modulelock.h"
 
 namespace foundation {
 
@@ -24,10 +27,38 @@ size_t Utf8Cut(const char* text, size_t length, size_t limit) {
 }
 }  // namespace
 
+namespace {
+
+std::atomic<LogMsg*> g_logger{nullptr};
+
+// The logger outlives static destruction while objects live, so that their worker threads may
+// still log during process exit. With none left (the module unloading, or a clean exit) no thread
+// of ours can log, and it goes with its file: a module loaded and unloaded again leaks nothing.
+struct LoggerEnd {
+    ~LoggerEnd() {
+        if (platform::ModuleLockCount() == 0) {
+            delete g_logger.exchange(nullptr);
+        }
+    }
+} g_loggerEnd;
+
+}  // namespace
+
 LogMsg& Logger() {
-    // Never destroyed, so worker threads may log during process exit.
-    static LogMsg* instance = new LogMsg();
-    return *instance;
+    LogMsg* logger = g_logger.load(std::memory_order_acquire);
+    if (logger == nullptr) {
+        std::unique_ptr<LogMsg> made(new LogMsg());
+        if (g_logger.compare_exchange_strong(logger, made.get(), std::memory_order_acq_rel)) {
+            logger = made.release();
+        }
+    }
+    return *logger;
+}
+
+LogMsg::~LogMsg() {
+    if (file_ != nullptr) {
+        std::fclose(file_);
+    }
 }
 
 const char* LogMsg::LevelText(int level) {

@@ -49,6 +49,7 @@ class LogMsg {
     std::string CurrentFileName() const;
 
     static const char* LevelText(int level);
+    ~LogMsg();
 
   private:
     friend LogMsg& Logger();
@@ -65,7 +66,8 @@ class LogMsg {
     std::atomic<bool> enabled_{false};
 };
 
-// The one logger of the process, created on first use and never destroyed.
+// The one logger of the process (of the module), created on first use; it is destroyed only when
+// no object of the module is left.
 LogMsg& Logger();
 
 }  // namespace foundation

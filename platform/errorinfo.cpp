@@ -5,6 +5,7 @@
 #include <nqportmanager/ComPtr.h>
 #include <nqportmanager/errorinfo.h>
 
+#include "platform/linux/threadslot.h"
 #include "platform/modulelock.h"
 
 namespace {
@@ -93,7 +94,8 @@ class ErrorInfo final : public IErrorInfo, public ICreateErrorInfo {
     platform::ModuleReference m_moduleLock;  // its code lives in the module
 };
 
-thread_local ComPtr<IErrorInfo> t_errorInfo;
+// Not a thread_local, so that the module can unload.
+platform::ThreadSlot<ComPtr<IErrorInfo>> g_errorInfo;
 
 }  // namespace
 
@@ -113,7 +115,11 @@ HRESULT CreateErrorInfo(ICreateErrorInfo** pperrinfo) {
 }
 
 HRESULT SetErrorInfo(ULONG, IErrorInfo* perrinfo) {
-    t_errorInfo = ComPtr<IErrorInfo>(perrinfo);
+    ComPtr<IErrorInfo>* slot = g_errorInfo.Get();
+    if (slot == nullptr) {
+        return E_OUTOFMEMORY;
+    }
+    *slot = ComPtr<IErrorInfo>(perrinfo);
     return S_OK;
 }
 
@@ -121,7 +127,8 @@ HRESULT GetErrorInfo(ULONG, IErrorInfo** pperrinfo) {
     if (pperrinfo == nullptr) {
         return E_POINTER;
     }
-    *pperrinfo = t_errorInfo.Detach();
+    ComPtr<IErrorInfo>* slot = g_errorInfo.Get();
+    *pperrinfo = slot != nullptr ? slot->Detach() : nullptr;
     return *pperrinfo != nullptr ? S_OK : S_FALSE;
 }
 

@@ -1,7 +1,8 @@
 // Creating the module's objects the way CoCreateInstance does on Windows: the class's
 // InprocServer32 from the registry (or a module path the caller gives), the module loaded, its
-// DllGetClassObject asked for the class factory, and the factory's CreateInstance. A client that
-// links libNqPortManager.so directly can call DllGetClassObject itself instead.
+// DllGetClassObject asked for the class factory, and the factory's CreateInstance. It lives in
+// libNqPortManagerClient.so (pkg-config nqportmanager-client, CMake NqPortManager::Client). A
+// client that links libNqPortManager.so directly can call DllGetClassObject itself instead.
 #pragma once
 
 #include <string>
@@ -28,6 +29,11 @@ class Module {
     bool Unload();
     bool IsLoaded() const { return m_handle != nullptr; }
     const std::string& Path() const { return m_path; }
+
+    // One of the module's exported functions (its C API: SysAllocString, SysFreeString, ...),
+    // for a client that loads the module instead of linking it: what the module allocates must
+    // be freed with the module's functions. Null when the module has no such name.
+    void* Symbol(const char* name) const;
 
     // The module's own message loop of the calling thread (see messageloop.h): the queue its
     // objects post to.

@@ -18,6 +18,7 @@
 #include <vector>
 
 #include "platform/kernel.h"
+#include "platform/linux/threadslot.h"
 
 namespace platform {
 
@@ -176,7 +177,21 @@ std::mutex g_windowsMutex;
 std::unordered_map<WindowHandle, WindowRecord> g_windows;
 std::atomic<uintptr_t> g_nextHandle{1};
 
-thread_local std::shared_ptr<Queue> t_queue;
+// Each thread's queue; not a thread_local, so that the module can unload.
+ThreadSlot<std::shared_ptr<Queue>> g_queues;
+
+std::shared_ptr<Queue>& ThisQueuePointer() {
+    std::shared_ptr<Queue>* queue = g_queues.Get();
+    if (queue == nullptr) {
+        // No thread key left in the process: the threads share one queue rather than none.
+        static std::shared_ptr<Queue> shared = std::make_shared<Queue>();
+        return shared;
+    }
+    if (!*queue) {
+        *queue = std::make_shared<Queue>();
+    }
+    return *queue;
+}
 
 // SIGINT and SIGTERM as a descriptor, once routed; it stays readable from the first signal on, so
 // every loop that watches it ends.
@@ -192,10 +207,7 @@ bool InterruptPending() {
 }
 
 Queue& ThisQueue() {
-    if (!t_queue) {
-        t_queue = std::make_shared<Queue>();
-    }
-    return *t_queue;
+    return *ThisQueuePointer();
 }
 
 std::shared_ptr<Queue> QueueOf(WindowHandle window) {
@@ -210,7 +222,7 @@ void Dispatch(const QueuedMessage& m) {
         std::lock_guard<std::mutex> lock(g_windowsMutex);
         auto it = g_windows.find(m.window);
         // Only the owning thread handles a window's messages.
-        if (it != g_windows.end() && it->second.queue == t_queue) {
+        if (it != g_windows.end() && it->second.queue == ThisQueuePointer()) {
             target = it->second.window;
         }
     }
@@ -245,10 +257,10 @@ bool MessageWindow::CreateMessageWindow() {
     if (handle_ != nullptr) {
         return true;
     }
-    ThisQueue();
+    const std::shared_ptr<Queue> queue = ThisQueuePointer();
     const auto handle = reinterpret_cast<WindowHandle>(g_nextHandle.fetch_add(1));
     std::lock_guard<std::mutex> lock(g_windowsMutex);
-    g_windows.emplace(handle, WindowRecord{t_queue, this});
+    g_windows.emplace(handle, WindowRecord{queue, this});
     handle_ = handle;
     return true;
 }

@@ -1,11 +1,12 @@
 #!/usr/bin/env bash
 # The installed package as a client sees it: the build installed into a temporary prefix,
 # examples/classify built against it with find_package and with pkg-config, both run against a
-# stund of its own on loopback.
+# stund of its own on loopback; then the module registered with the installed nqpm and a client
+# that loads it through the client helper, which must unload it cleanly.
 #   package_test.sh BUILD-DIR SOURCE-DIR
 set -euo pipefail
 build=$1
-src=$2
+src=$(cd "$2" && pwd)
 command -v stund >/dev/null || PATH=$PATH:/usr/sbin:/sbin
 command -v stund >/dev/null || { echo "stund is not installed"; exit 77; }
 
@@ -33,6 +34,20 @@ libdir=$(dirname "$(find "$prefix" -name 'libNqPortManager.so' | head -1)")
 export PKG_CONFIG_PATH=$libdir/pkgconfig
 # shellcheck disable=SC2046
 g++ -o "$tmp/with-pkg-config" "$src/examples/classify/main.cpp" $(pkg-config --cflags --libs nqportmanager)
+mkdir "$tmp/unload"
+cat >"$tmp/unload/CMakeLists.txt" <<EOF
+cmake_minimum_required(VERSION 3.25)
+project(unload_client LANGUAGES CXX)
+set(CMAKE_CXX_STANDARD 20)
+find_package(NqPortManager 0.1 REQUIRED)
+add_executable(unload_client $src/tests/NqPortManager/package/unload_client.cpp)
+target_link_libraries(unload_client PRIVATE NqPortManager::Client)
+EOF
+cmake -S "$tmp/unload" -B "$tmp/unload/build" -DCMAKE_PREFIX_PATH="$prefix" >/dev/null
+cmake --build "$tmp/unload/build" >/dev/null
+if readelf -d "$tmp/unload/build/unload_client" | grep -q 'libNqPortManager\.so'; then
+    echo "the helper's client links the module itself"; exit 1
+fi
 
 # A loopback pair of addresses of this run's own, so that other tests' servers stay apart.
 base=127.$(( $$ % 200 + 30 )).$(( RANDOM % 250 + 1 ))
@@ -48,3 +63,7 @@ for client in "$tmp/with-cmake/classify" "$tmp/with-pkg-config"; do
     echo "$out"
     grep -q '^state 2, ' <<<"$out" || { echo "$client: the discovery did not complete"; exit 1; }
 done
+
+export NQPM_REGISTRY=$tmp/registry.json
+"$prefix/bin/nqpm" register >/dev/null
+LD_LIBRARY_PATH=$libdir "$tmp/unload/build/unload_client" "$base.1"

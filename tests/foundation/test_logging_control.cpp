@@ -15,17 +15,26 @@ class LoggingControl : public ::testing::Test {
     }
 };
 
-TEST_F(LoggingControl, InitializeClampsTheLevelButPutStoresItUnchanged) {
+TEST_F(LoggingControl, InitializeClampsTheLevelPutStoresItAndEnabledFollowsNonZero) {
     INT level = -1;
-    ASSERT_EQ(foundation::InitializeLogging(nullptr, nullptr, nullptr, 7, VARIANT_TRUE), S_OK);
-    ASSERT_EQ(foundation::GetLogLevel(&level), S_OK);
-    EXPECT_EQ(level, 4);
-    foundation::InitializeLogging(nullptr, nullptr, nullptr, -3, VARIANT_TRUE);
-    foundation::GetLogLevel(&level);
-    EXPECT_EQ(level, 0);
+    VARIANT_BOOL enabled = 5;
+    for (const auto& [put, clamped] : {std::pair{7, 4}, std::pair{-3, 0}, std::pair{2, 2}}) {
+        ASSERT_EQ(foundation::InitializeLogging(nullptr, nullptr, nullptr, put, 1), S_OK);
+        ASSERT_EQ(foundation::GetLogLevel(&level), S_OK);
+        EXPECT_EQ(level, clamped);
+        ASSERT_EQ(foundation::GetLoggingEnabled(&enabled), S_OK);
+        EXPECT_EQ(enabled, VARIANT_TRUE);
+    }
     foundation::PutLogLevel(7);
+    foundation::PutLoggingEnabled(VARIANT_FALSE);
     foundation::GetLogLevel(&level);
-    EXPECT_EQ(level, 7);
+    foundation::GetLoggingEnabled(&enabled);
+    EXPECT_EQ(std::make_pair(level, enabled), std::make_pair(7, VARIANT_BOOL{VARIANT_FALSE}));
+    EXPECT_EQ(foundation::GetLogLevel(nullptr), E_POINTER);
+    EXPECT_EQ(foundation::GetLogFolder(nullptr), E_POINTER);
+    EXPECT_EQ(foundation::GetLogFilePrefix(nullptr), E_POINTER);
+    EXPECT_EQ(foundation::GetLogFileExtension(nullptr), E_POINTER);
+    EXPECT_EQ(foundation::GetLoggingEnabled(nullptr), E_POINTER);
 }
 
 TEST_F(LoggingControl, NamesAreNullUntilSetAndCopiesAfterwards) {
@@ -48,24 +57,6 @@ TEST_F(LoggingControl, NamesAreNullUntilSetAndCopiesAfterwards) {
     EXPECT_FALSE(gotPrefix.IsNull());  // an empty string stays distinct from none
     EXPECT_EQ(gotPrefix.Length(), 0u);
     EXPECT_TRUE(gotExt.IsNull());
-}
-
-TEST_F(LoggingControl, EnabledFlagFollowsAnyNonZeroValue) {
-    VARIANT_BOOL enabled = 5;
-    foundation::PutLoggingEnabled(1);
-    ASSERT_EQ(foundation::GetLoggingEnabled(&enabled), S_OK);
-    EXPECT_EQ(enabled, VARIANT_TRUE);
-    foundation::PutLoggingEnabled(VARIANT_FALSE);
-    foundation::GetLoggingEnabled(&enabled);
-    EXPECT_EQ(enabled, VARIANT_FALSE);
-}
-
-TEST_F(LoggingControl, NullOutPointersGiveEPointer) {
-    EXPECT_EQ(foundation::GetLogLevel(nullptr), E_POINTER);
-    EXPECT_EQ(foundation::GetLogFolder(nullptr), E_POINTER);
-    EXPECT_EQ(foundation::GetLogFilePrefix(nullptr), E_POINTER);
-    EXPECT_EQ(foundation::GetLogFileExtension(nullptr), E_POINTER);
-    EXPECT_EQ(foundation::GetLoggingEnabled(nullptr), E_POINTER);
 }
 
 }  // namespace

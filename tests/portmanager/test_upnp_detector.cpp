@@ -141,41 +141,31 @@ TEST_F(UpnpDetectorTest, PostsTheProbesAnswerOnceToTheOwnerThreadAndRejectsANull
     }
 }
 
-TEST_F(UpnpDetectorTest, StartWhileADetectionRunsAddsNoDetectionAndNoMessage) {
+TEST_F(UpnpDetectorTest, StartWhileRunningAddsNothingAndStartAfterTheMessageRunsAgain) {
+    // Held in the probe: a second Start adds no detection and no message.
     probe_.holdUntilReleased = true;
     ASSERT_NO_FATAL_FAILURE(StartAndEnterProbe());
-    EXPECT_EQ(detector_->Start(window_.Handle(), kDetected + 1, 2), S_OK);
-    probe_.release.Set();
-    ASSERT_TRUE(window_.WaitFor(1));
-    DestroyAndDrain(window_, detector_);
-
-    EXPECT_EQ(probe_.calls.load(), 1);
-    ASSERT_EQ(window_.deliveries.size(), 1u);
-    EXPECT_EQ(window_.deliveries[0].message, kDetected);
-    EXPECT_EQ(window_.deliveries[0].wParam, 0u);
-}
-
-TEST_F(UpnpDetectorTest, StartAfterTheMessageRunsANewDetectionWithItsOwnOutcome) {
+    EXPECT_EQ(detector_->Start(window_.Handle(), kDetected + 1, 9), S_OK);
     // The port manager may start again from the very handler of the message, while the thread
     // that posted it is still returning; and again later from outside.
-    NewDetector();
     window_.onDelivery = [&] {
         if (window_.deliveries.size() == 1) {
             probe_.answer = true;
-            EXPECT_EQ(detector_->Start(window_.Handle(), kDetected, 2), S_OK);
+            EXPECT_EQ(detector_->Start(window_.Handle(), kDetected, 1), S_OK);
         }
     };
-    ASSERT_EQ(detector_->Start(window_.Handle(), kDetected, 1), S_OK);
+    probe_.release.Set();
     ASSERT_TRUE(window_.WaitFor(2));
     probe_.answer = false;
-    ASSERT_EQ(detector_->Start(window_.Handle(), kDetected, 3), S_OK);
+    ASSERT_EQ(detector_->Start(window_.Handle(), kDetected, 2), S_OK);
     ASSERT_TRUE(window_.WaitFor(3));
     DestroyAndDrain(window_, detector_);
 
     EXPECT_EQ(probe_.calls.load(), 3);
     ASSERT_EQ(window_.deliveries.size(), 3u);
     for (size_t i = 0; i < 3; ++i) {
-        EXPECT_EQ(window_.deliveries[i].wParam, i + 1) << i;
+        EXPECT_EQ(window_.deliveries[i].message, kDetected) << i;
+        EXPECT_EQ(window_.deliveries[i].wParam, i) << i;
         EXPECT_EQ(window_.deliveries[i].found, i == 1) << i;
     }
 }

@@ -7,7 +7,6 @@
 #include <cstdlib>
 #include <cstring>
 #include <functional>
-#include <random>
 #include <string>
 #include <tuple>
 #include <vector>
@@ -140,15 +139,6 @@ TEST(STUNMessageEncode, WritesExactRequestBytes) {
          "0003000400000006"
          "000200080001ea607f000001",
          20},
-        {"odd reserved and family sent as stored",
-         [](CSTUNMessage& m) {
-             SetResponseAddress(m, 0x0A000001, 1, 12);
-             m.m_responseAddress.m_reserved = 0xAB;
-             m.m_responseAddress.m_family = 0x02;
-         },
-         "00020008ab0200010a000001", 12},
-        {"stored length kept, never computed", [](CSTUNMessage& m) { m.m_messageLength = 0x1234; },
-         "", 0x1234},
         // Presence means the slot type equals the attribute's own code.
         {"slot with a foreign type is absent",
          [](CSTUNMessage& m) {
@@ -326,40 +316,6 @@ TEST(STUNMessageDecode, TruncatedStundAnswers) {
     }
 }
 
-// Random and half-plausible datagrams: nothing may be read outside the buffer (ASan), and an
-// accepted parse only ever comes with a matching header length.
-TEST(STUNMessageDecode, SurvivesRandomInput) {
-    std::mt19937 rng(20240611);
-    const uint16_t types[] = {0x0001, 0x0002, 0x0003, 0x0004, 0x0005, 0x000B, 0x0020, 0x8022};
-    int accepted = 0;
-    for (int i = 0; i < 20000; ++i) {
-        Bytes b(i % 2 == 0 ? rng() % 80 : 0);
-        for (uint8_t& x : b) {
-            x = static_cast<uint8_t>(rng());
-        }
-        if (i % 2 == 1) {
-            // A right header with attributes whose lengths are often a little off.
-            Response r;
-            for (int k = static_cast<int>(rng() % 5); k > 0; --k) {
-                const uint16_t type = types[rng() % 8];
-                const size_t size = rng() % 14;
-                const int skew = rng() % 4 == 0 ? static_cast<int>(rng() % 5) - 2 : 0;
-                r.Raw(type, static_cast<uint16_t>(std::max(0, static_cast<int>(size) + skew)),
-                      Bytes(size, static_cast<uint8_t>(rng())));
-            }
-            b = r.Build();
-        }
-        CSTUNMessage m;
-        if (DecodeExact(m, b)) {
-            ++accepted;
-            ASSERT_GT(b.size(), 20u);
-            ASSERT_EQ(static_cast<size_t>((b[2] << 8) | b[3]), b.size() - 20);
-        }
-    }
-    // The structured half must reach deep into the parser, not bounce off the header.
-    EXPECT_GT(accepted, 1000);
-}
-
 TEST(STUNMessageDecode, LogsEachAddressAttributeAtInfo) {
     const Bytes datagram = Response()
                                .Address(1, 0x01020304, 5)
@@ -380,12 +336,6 @@ TEST(STUNMessageDecode, LogsEachAddressAttributeAtInfo) {
         got.push_back(line.message);
     }
     EXPECT_EQ(got, expected);
-
-    foundation::Logger().Initialize(std::nullopt, std::nullopt, std::nullopt, foundation::kLogWarn,
-                                    true);
-    capture.Clear();
-    ASSERT_TRUE(DecodeExact(m, datagram));
-    EXPECT_TRUE(capture.LinesOf("CSTUNMessage::RecvFrom").empty());
 }
 
 TEST(STUNMessageSocket, RecvFromTakesAtMost1024Bytes) {

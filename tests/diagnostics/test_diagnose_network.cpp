@@ -188,6 +188,7 @@ TEST_F(DiagnoseNetwork, EarlyStopsNameTheirTestCodeAndInformation) {
         net.adapters[0].gateway = c.gateway;
         routes.error = c.routeError;
         sink.seen.clear();
+        const int descriptors = platform::CountOpenDescriptors();
         ASSERT_EQ(Diagnose(c.wellKnown, c.stun, "127.0.0.1", 7000, 100, 9), S_OK);
         ASSERT_TRUE(PumpUntil(sink, 1));
         const Seen& s = sink.seen.front();
@@ -201,19 +202,22 @@ TEST_F(DiagnoseNetwork, EarlyStopsNameTheirTestCodeAndInformation) {
             const bool ran = type < c.type && type != PMNTT_TEST_PING_GATEWAY;
             EXPECT_EQ(record.m_errorCode, type == c.type ? c.code : ran ? 0 : 1) << type;
         }
+        EXPECT_EQ(platform::CountOpenDescriptors(), descriptors) << "a finished run's";
     }
     EXPECT_EQ(routes.lastDestination.load(), platform::InetAddrNet("192.0.2.1"));
 }
 
-TEST_F(DiagnoseNetwork, ShutdownDuringARunReturnsPromptlyAndFiresNothing) {
+TEST_F(DiagnoseNetwork, ShutdownDuringARunReturnsPromptlyFiresNothingAndLeavesNoDescriptor) {
     DiagnosticSink& sink = sinks.emplace_back();
     Connect(sink);
+    const int descriptors = platform::CountOpenDescriptors();
     ASSERT_EQ(Diagnose("192.0.2.1", SilentAddress(), "127.0.0.1", 7000, 100, 1), S_OK);
     ASSERT_EQ(Diagnose("192.0.2.1", SilentAddress(), "127.0.0.1", 7000, 100, 2), S_OK);
     platform::RunMessageLoopUntil([] { return false; }, 300);  // both wait for STUN answers
     const auto start = std::chrono::steady_clock::now();
     EXPECT_EQ(pm->Shutdown(), S_OK);
     EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(1000));
+    EXPECT_EQ(platform::CountOpenDescriptors(), descriptors);
     platform::RunMessageLoopUntil([] { return false; }, 200);
     EXPECT_TRUE(sink.seen.empty());
 }

@@ -162,9 +162,11 @@ TEST_F(Profiles, EnablePreconditions) {
     EXPECT_EQ(h.pm->OnBeforeEnableProfileEx(wrong, minPort, maxPort, 2, VARIANT_FALSE),
               E_INVALIDARG);
     VariantClear(&wrong);
-    EXPECT_EQ(Enable({}), E_FAIL);                       // no address at all
-    EXPECT_EQ(Enable({"192.0.2.99:5060"}), E_FAIL);      // none equal to the private address
+    EXPECT_EQ(Enable({}), E_FAIL);                   // no address at all
+    EXPECT_EQ(Enable({"192.0.2.99:5060"}), E_FAIL);  // none equal to the private address
+    const int descriptors = platform::CountOpenDescriptors();
     EXPECT_EQ(Enable({"127.0.0.1"}, -1), E_INVALIDARG);  // before any port is bound
+    EXPECT_EQ(platform::CountOpenDescriptors(), descriptors);
     ASSERT_EQ(EnableSip(), S_OK);
     EXPECT_EQ(EnableSip(), E_FAIL);  // already enabled
     EXPECT_EQ(h.pm->OnBeforeDisableProfile(), S_OK);

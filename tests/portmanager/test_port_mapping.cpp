@@ -117,10 +117,12 @@ TEST_F(RefreshTest, RefreshPortMappingsTracesAndRefreshesEveryElementInOrder) {
                                      MappingFrom(m_port + 2)};
     // Limited broadcast without SO_BROADCAST: the kernel refuses it with EACCES.
     list[3].m_remote = {"255.255.255.255", 9};
+    const int before = platform::CountOpenDescriptors();  // every keep-alive socket is closed
     RefreshPortMappings({});
     RefreshPortMappings(list);
     EXPECT_EQ(NextSender(), m_port);
     EXPECT_EQ(NextSender(), m_port + 1);
+    EXPECT_EQ(platform::CountOpenDescriptors(), before);
     const auto lines = m_log.Lines();
     ASSERT_EQ(lines.size(), 5u);
     for (const int i : {0, 1}) {

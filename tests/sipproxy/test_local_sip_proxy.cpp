@@ -29,7 +29,9 @@ TEST_F(Proxy, SenderEndpointFollowsTheInternalSocketButNotWhileRunning) {
     ASSERT_EQ(first.rfind("127.0.0.1:", 0), 0u) << first;
     const int port = std::stoi(first.substr(10));
     EXPECT_TRUE(port >= 10000 && port <= 60000) << first;  // from the rotating sequence
+    const int descriptors = platform::CountOpenDescriptors();
     ASSERT_EQ(SetInternal(), S_OK);
+    EXPECT_EQ(platform::CountOpenDescriptors(), descriptors) << "the old socket stays open";
     EXPECT_NE(SenderEndpoint(), first);
     BStr internal;
     EXPECT_EQ(proxy->get_InternalAddress(internal.Out()), S_OK);

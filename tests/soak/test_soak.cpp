@@ -4,10 +4,12 @@
 #include <dlfcn.h>
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <fstream>
 #include <iostream>
 #include <optional>
 #include <string>
+#include <thread>
 
 #include <nqportmanager/NqPortManager.h>
 
@@ -138,8 +140,10 @@ class Soak : public sipproxy::testing::ProxyFixture {
         ASSERT_TRUE(platform::RunMessageLoopUntil([&] { return diagSink.received.size() > before; },
                                                   20000));
         EXPECT_EQ(diagSink.received.back().type, PME_DIAGNOSTIC_COMPLETED);
-        // A clean run sends four SIP and four media samples to the echo server.
+        // A clean run sends four SIP and four media samples to the echo server, and closes its
+        // control connection.
         EXPECT_EQ(echo.Datagrams().size(), 8 * diagSink.received.size());
+        ASSERT_TRUE(echo.WaitIdle(2000));
     }
 
     ComPtr<IPortMappingProvider> provider;
@@ -184,7 +188,12 @@ TEST_P(SoakCycles, LeaveDescriptorsThreadsAndMemoryFlat) {
     if (c.end != nullptr) {
         (this->*c.end)();
     }
-    const testsupport::ProcessResources end = testsupport::ProcessResources::Now();
+    // The last run's or relay's thread may still be on its way out, with its sockets.
+    testsupport::ProcessResources end = testsupport::ProcessResources::Now();
+    for (int i = 0; i < 150 && end.threads.size() > start.threads.size(); ++i) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(20));
+        end = testsupport::ProcessResources::Now();
+    }
     // The same numbers; a re-made pool's sockets are new ones under them.
     const auto numbers = [](const testsupport::ProcessResources& r) {
         std::string text;

@@ -198,7 +198,8 @@ TEST_F(STUNResultInATransaction, RefreshesDuringAPassGiveExactlyOneFurtherPass) 
     EXPECT_TRUE(service.IsSTUNResultReady());
 }
 
-TEST_F(STUNResultInATransaction, StopEndsThePassAtOnceWithoutResult) {
+TEST_F(STUNResultInATransaction, StopEndsThePassAtOnceWithoutResultOrOpenDescriptor) {
+    const int descriptors = platform::CountOpenDescriptors();
     CSTUNResult service(server_.c_str(), window_.Handle(), kMessage, kWParam, local_);
     ASSERT_EQ(service.Refresh(), S_OK);
     ASSERT_TRUE(fake_->WaitForRequests(2, 5000));  // inside the retransmission schedule
@@ -206,6 +207,8 @@ TEST_F(STUNResultInATransaction, StopEndsThePassAtOnceWithoutResult) {
     service.Stop();
     EXPECT_LT(Clock::now() - stopping, std::chrono::milliseconds(300));
     EXPECT_FALSE(service.IsRunning());
+    // Stop itself, not only the destructor, lets go of the monitor and the pass's sockets.
+    EXPECT_EQ(platform::CountOpenDescriptors(), descriptors);
     EXPECT_FALSE(window_.WaitFor(1, 300)) << "the stopped pass posted";
     EXPECT_FALSE(service.IsSTUNResultReady()) << "the stopped pass stored its results";
 }

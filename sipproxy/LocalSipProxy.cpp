@@ -154,7 +154,13 @@ HRESULT CLocalSipProxy::Start(IAdvancedPortManager* pPortManager, LONG minPort, 
         return hr;
     }
     const std::string internalAddress = m_internalSocket.LocalAddressText();
-    m_externalSocket.Open(internalAddress, minPort, maxPort, vbRandomize != VARIANT_FALSE);
+    if (!m_externalSocket.Open(internalAddress, minPort, maxPort, vbRandomize != VARIANT_FALSE)) {
+        // Without it nothing could reach the server: say so instead of starting a dead relay.
+        NQ_LOG("CLocalSipProxy::Start", foundation::kLogError,
+               "cannot open the external socket on %s", internalAddress.c_str());
+        m_rewriter.SetTexts(std::move(texts));
+        return E_FAIL;
+    }
     m_serverHost = platform::NetToHost32(serverNet);
     texts.m_internalAddress = internalAddress;
     texts.m_mappingPublicAddress = m_mappingPublicAddress.Utf8();

@@ -5,11 +5,13 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <deque>
 #include <filesystem>
 #include <optional>
 #include <string>
 
+#include "portmanager/PortMapping.h"
 #include "sipproxy/LocalSipProxy.h"
 #include "tests/portmanager/port_mapping_test_support.h"
 #include "tests/support/FakeNetworkInfo.h"
@@ -87,12 +89,15 @@ class ProxyFixture : public ::testing::Test {
         const std::string e = SenderEndpoint();
         return static_cast<uint16_t>(std::stoi(e.substr(e.find(':') + 1)));
     }
-    // The next datagram at the server that the proxy sent (the port manager's keep-alives from
-    // its SIP mapping are passed over).
+    // The next datagram at the server that the proxy sent. The port manager's keep-alives from
+    // its SIP mapping are passed over by their bytes: the proxy's rotating external port may
+    // well be the mapping's port, free again once the mapping is taken.
     std::optional<LoopbackSocket::Datagram> ServerReceive() {
         for (;;) {
             auto d = server.Receive();
-            if (!d || d->fromPort != sipMappingPort) {
+            if (!d || d->fromPort != sipMappingPort ||
+                !std::equal(d->bytes.begin(), d->bytes.end(), std::begin(portmanager::kKeepAlive),
+                            std::end(portmanager::kKeepAlive))) {
                 return d;
             }
         }

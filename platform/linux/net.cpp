@@ -18,6 +18,7 @@
 #include <optional>
 
 #include "platform/kernel.h"
+#include "platform/modulelock.h"
 
 namespace platform {
 
@@ -117,6 +118,9 @@ struct AsyncLookup {
     gaicb request{};
     int doneFd = eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
     std::atomic<int> holders{2};
+    // The notification runs our code in the resolver's thread, also after a stopped waiter has
+    // gone: until then the module must not unload.
+    ModuleReference moduleLock;
 
     void Drop() {
         if (--holders == 0) {
@@ -167,7 +171,11 @@ std::optional<int> ResolveInterruptibly(const std::string& name, uint32_t* netAd
             break;
         }
         case WaitResult::Stopped:
-            gai_cancel(&lookup->request);  // best effort; the resolver frees it when it ends
+            // A request still queued is taken back and never notified: its hold goes here.
+            // One already running ends in the resolver, which then lets go.
+            if (gai_cancel(&lookup->request) == EAI_CANCELED) {
+                lookup->Drop();
+            }
             result = kErrInterrupted;
             break;
         default:

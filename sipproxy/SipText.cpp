@@ -1,6 +1,8 @@
 #include "sipproxy/SipText.h"
 
+#include <algorithm>
 #include <climits>
+#include <cstddef>
 
 #include "platform/kernel.h"
 
@@ -59,15 +61,43 @@ bool IsHeaderName(const std::string& text, size_t begin, size_t end, const std::
     return true;
 }
 
-// A Call-ID is an opaque word that often ends in "@host"; changing it breaks the dialog.
-bool InCallIdHeader(const std::string& text, size_t at) {
-    const size_t previous = at < 2 ? std::string::npos : text.rfind("\r\n", at - 2);
-    const size_t lineStart = previous == std::string::npos ? 0 : previous + 2;
-    const size_t colon = text.find(':', lineStart);
-    return colon != std::string::npos && colon < at &&
-           (IsHeaderName(text, lineStart, colon, "call-id") ||
-            IsHeaderName(text, lineStart, colon, "i"));
-}
+// The line of a match, as the matches are met left to right: each CR LF and the first colon of a
+// line are looked for once, so that a hostile datagram of many matches on one long line costs one
+// pass, not one pass a match.
+class LineOfMatch {
+  public:
+    explicit LineOfMatch(const std::string& text) : text_(text), nextBreak_(text.find("\r\n")) {}
+
+    // A Call-ID is an opaque word that often ends in "@host"; changing it breaks the dialog.
+    bool InCallIdHeader(size_t at) {
+        // A line starts after a CR LF that ends at or before the match.
+        while (nextBreak_ != std::string::npos && nextBreak_ + 2 <= at) {
+            lineStart_ = nextBreak_ + 2;
+            nextBreak_ = text_.find("\r\n", lineStart_);
+            known_ = false;
+        }
+        if (!known_) {
+            if (!noColonLeft_ && (colon_ == std::string::npos || colon_ < lineStart_)) {
+                colon_ = text_.find(':', lineStart_);
+                noColonLeft_ = colon_ == std::string::npos;
+            }
+            callId_ = colon_ != std::string::npos &&
+                      (IsHeaderName(text_, lineStart_, colon_, "call-id") ||
+                       IsHeaderName(text_, lineStart_, colon_, "i"));
+            known_ = true;
+        }
+        return callId_ && colon_ < at;
+    }
+
+  private:
+    const std::string& text_;
+    size_t nextBreak_;
+    size_t lineStart_ = 0;
+    size_t colon_ = std::string::npos;  // the first colon at or after lineStart_
+    bool noColonLeft_ = false;
+    bool known_ = false;
+    bool callId_ = false;
+};
 }  // namespace
 
 std::string ReplaceBareHost(const std::string& text, const std::string& pattern,
@@ -75,27 +105,28 @@ std::string ReplaceBareHost(const std::string& text, const std::string& pattern,
     if (pattern.empty()) {
         return text;
     }
-    std::string work = text;
-    size_t start = 0;
-    for (;;) {
-        const size_t at = work.find(pattern, start);
-        if (at == std::string::npos) {
-            break;
-        }
+    // Built once, left to right, each match judged by the text as it came: a copy edited in place
+    // costs a move of the rest for every match.
+    std::string out;
+    out.reserve(text.size());
+    LineOfMatch line(text);
+    size_t from = 0;
+    for (size_t at = text.find(pattern); at != std::string::npos;
+         at = text.find(pattern, at + pattern.size())) {
         const size_t after = at + pattern.size();
-        if (after >= work.size()) {
+        if (after >= text.size()) {
             break;
         }
-        const bool keep = work[after] == ':' || work.compare(after, 8, ";dstport") == 0 ||
-                          at <= 1 || work[at - 1] == '=' || InCallIdHeader(work, at);
-        if (keep) {
-            start = after;
-            continue;
+        const bool keep = text[after] == ':' || text.compare(after, 8, ";dstport") == 0 ||
+                          at <= 1 || text[at - 1] == '=' || line.InCallIdHeader(at);
+        if (!keep) {
+            out.append(text, from, at - from);
+            out += replacement;
+            from = after;
         }
-        work.replace(at, pattern.size(), replacement);
-        start = at + replacement.size();
     }
-    return work;
+    out.append(text, from, std::string::npos);
+    return out;
 }
 
 namespace {
@@ -157,7 +188,11 @@ std::string CorrectContentLength(const std::string& original, const std::string&
         if (lineEnd == std::string::npos || lineEnd > end) {
             lineEnd = end;
         }
-        const size_t colon = rewritten.find(':', lineStart);
+        // Within the line: a search to the end of the text for every line would go quadratic.
+        const size_t colon = static_cast<size_t>(
+            std::find(rewritten.begin() + static_cast<std::ptrdiff_t>(lineStart),
+                      rewritten.begin() + static_cast<std::ptrdiff_t>(lineEnd), ':') -
+            rewritten.begin());
         if (lineStart > 0 && colon < lineEnd && IsContentLengthName(rewritten, lineStart, colon)) {
             size_t valueStart = colon + 1;
             while (valueStart < lineEnd && IsLineSpace(rewritten[valueStart])) {

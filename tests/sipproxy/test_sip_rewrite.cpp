@@ -172,6 +172,11 @@ TEST(SipText, ReplaceBareHostKeepsPortsParametersValuesAndTheEnds) {
     EXPECT_EQ(sipproxy::ReplaceBareHost("ab 1.2.3.4;", p, r), "ab 1.2.3.4;");  // at the end
     EXPECT_EQ(sipproxy::ReplaceBareHost("ab 1.2.3.4;:", p, r), "ab 1.2.3.4;:");
     EXPECT_EQ(sipproxy::ReplaceBareHost("ab 1.2.3.4;;dstport", p, r), "ab 1.2.3.4;;dstport");
+    // Only the Call-ID line keeps its host, whatever lines come before and after it.
+    EXPECT_EQ(sipproxy::ReplaceBareHost("x\r\ni : a@1.2.3.4;b\r\nVia: 1.2.3.4;c 1.2.3.4;d\r\n"
+                                        "no colon 1.2.3.4;e",
+                                        p, r),
+              "x\r\ni : a@1.2.3.4;b\r\nVia: 5.6.7.8:9;c 5.6.7.8:9;d\r\nno colon 5.6.7.8:9;e");
     // A replacement that holds its pattern is not searched again.
     EXPECT_EQ(sipproxy::ReplaceBareHost("ab 1.2.3.4;x 1.2.3.4;y", p, "x1.2.3.4;"),
               "ab x1.2.3.4;x x1.2.3.4;y");

@@ -5,6 +5,8 @@
 // "Net", which means network order as the resolver and inet_addr give it.
 #pragma once
 
+#include "platform/system_names.h"
+
 #include <cstddef>
 #include <cstdint>
 #include <string>

@@ -4,6 +4,7 @@
 #include <nqportmanager/cominterfaces.h>
 #include <nqportmanager/comtypes.h>
 
+#ifndef _WIN32
 struct SAFEARRAY;
 
 enum VARENUM {
@@ -71,3 +72,4 @@ NQ_MODULE_EXPORT void VariantInit(VARIANTARG* pvarg);
 NQ_MODULE_EXPORT HRESULT VariantClear(VARIANTARG* pvarg);
 NQ_MODULE_EXPORT HRESULT VariantCopy(VARIANTARG* pvargDest, const VARIANTARG* pvargSrc);
 }  // extern "C"
+#endif  // _WIN32

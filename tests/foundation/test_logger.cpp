@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "foundation/Logger.h"
+#include "platform/fs.h"
 #include "platform/kernel.h"
 
 namespace {
@@ -53,7 +54,7 @@ class LoggerTest : public ::testing::Test {
         const auto t = platform::GetLocalTime();
         char date[32];
         std::snprintf(date, sizeof date, "-%04d-%02d-%02d", t.year, t.month, t.day);
-        return folder + "/" + prefix + date + ext;
+        return folder + platform::kPathSeparator + prefix + date + ext;
     }
 
     fs::path dir_;

@@ -1,6 +1,7 @@
 # The Windows build: the same logic folders over platform/win32. Test executables are linked
 # statically (no mingw runtime DLLs to find under Wine) and run under Wine through CTest, in a
 # prefix of their own in the build tree.
+enable_language(RC)
 add_compile_definitions(__USE_MINGW_ANSI_STDIO=1)
 add_link_options(-static -static-libgcc -static-libstdc++)
 
@@ -10,6 +11,12 @@ add_subdirectory(stun)
 add_subdirectory(diagnostics)
 add_subdirectory(portmanager)
 add_subdirectory(sipproxy)
+# The header-only JSON library, without the rest of the host's include folder.
+file(MAKE_DIRECTORY ${CMAKE_BINARY_DIR}/json-include)
+file(CREATE_LINK /usr/include/nlohmann ${CMAKE_BINARY_DIR}/json-include/nlohmann SYMBOLIC)
+add_library(nlohmann_json INTERFACE)
+target_include_directories(nlohmann_json SYSTEM INTERFACE ${CMAKE_BINARY_DIR}/json-include)
+add_library(nlohmann_json::nlohmann_json ALIAS nlohmann_json)
 include(NqPortManager/windows.cmake)
 
 if(NQPM_BUILD_TESTS)
@@ -34,12 +41,6 @@ exec "@NQ_WINE_PROGRAM@" "$@"
   set(gtest_disable_pthreads OFF CACHE BOOL "" FORCE)
   # GoogleTest built from its Debian sources for the target (it names GTest::gtest itself).
   add_subdirectory(/usr/src/googletest ${CMAKE_BINARY_DIR}/googletest EXCLUDE_FROM_ALL)
-  # The header-only JSON library, without the rest of the host's include folder.
-  file(MAKE_DIRECTORY ${CMAKE_BINARY_DIR}/json-include)
-  file(CREATE_LINK /usr/include/nlohmann ${CMAKE_BINARY_DIR}/json-include/nlohmann SYMBOLIC)
-  add_library(nlohmann_json INTERFACE)
-  target_include_directories(nlohmann_json SYSTEM INTERFACE ${CMAKE_BINARY_DIR}/json-include)
-  add_library(nlohmann_json::nlohmann_json ALIAS nlohmann_json)
 
   add_subdirectory(tests/windows)
 endif()

@@ -22,7 +22,7 @@ add_custom_command(OUTPUT ${NQ_RES_DIR}/NqPortManager.rc
 
 file(GLOB NQ_MODULE_SOURCES CONFIGURE_DEPENDS ${CMAKE_CURRENT_LIST_DIR}/*.cpp)
 list(REMOVE_ITEM NQ_MODULE_SOURCES ${CMAKE_CURRENT_LIST_DIR}/Module.cpp
-     ${CMAKE_CURRENT_LIST_DIR}/ClientApi.cpp ${CMAKE_CURRENT_LIST_DIR}/Client.cpp)
+     ${CMAKE_CURRENT_LIST_DIR}/ClientApi.cpp)
 add_library(nq_module STATIC ${NQ_MODULE_SOURCES})
 target_link_libraries(nq_module PUBLIC nq_platform PRIVATE nlohmann_json::nlohmann_json)
 

@@ -18,6 +18,13 @@ add_library(nlohmann_json INTERFACE)
 target_include_directories(nlohmann_json SYSTEM INTERFACE ${CMAKE_BINARY_DIR}/json-include)
 add_library(nlohmann_json::nlohmann_json ALIAS nlohmann_json)
 include(NqPortManager/windows.cmake)
+# nqpm.exe, the command-line client, from the same sources.
+file(GLOB NQPM_SOURCES CONFIGURE_DEPENDS ${PROJECT_SOURCE_DIR}/tools/nqpm/*.cpp)
+list(REMOVE_ITEM NQPM_SOURCES ${PROJECT_SOURCE_DIR}/tools/nqpm/main.cpp)
+add_library(nq_cli STATIC ${NQPM_SOURCES})
+target_link_libraries(nq_cli PUBLIC nq_portmanager nq_sipproxy nq_module nlohmann_json::nlohmann_json)
+add_executable(nqpm ${PROJECT_SOURCE_DIR}/tools/nqpm/main.cpp)
+target_link_libraries(nqpm PRIVATE nq_cli)
 
 if(NQPM_BUILD_TESTS)
   enable_testing()

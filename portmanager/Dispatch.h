@@ -1,8 +1,13 @@
-// IDispatch for objects that have no type information on this platform: callers use the
-// vtable. Late-bound calls fail cleanly instead of reaching a member by accident.
+// IDispatch of the module's dual interfaces: served from the type library where the platform has
+// one (oleaut32 on Windows); elsewhere there is no type information and callers use the vtable,
+// so late-bound calls fail cleanly instead of reaching a member by accident.
 #pragma once
 
+#include <nqportmanager/ComPtr.h>
+#include <nqportmanager/NqPortManager.h>
 #include <nqportmanager/com.h>
+
+#include "platform/typeinfo.h"
 
 namespace portmanager {
 
@@ -13,20 +18,24 @@ class NoTypeInfoDispatch : public Base {
         if (pctinfo == nullptr) {
             return E_POINTER;
         }
-        *pctinfo = 0;
+        *pctinfo = Info() != nullptr ? 1 : 0;
         return S_OK;
     }
-    HRESULT GetTypeInfo(UINT, LCID, ITypeInfo** ppTInfo) override {
-        if (ppTInfo != nullptr) {
-            *ppTInfo = nullptr;
-        }
-        return TYPE_E_ELEMENTNOTFOUND;
+    HRESULT GetTypeInfo(UINT index, LCID, ITypeInfo** ppTInfo) override {
+        return platform::DispatchGetTypeInfo(Info(), index, ppTInfo);
     }
-    HRESULT GetIDsOfNames(REFIID, LPOLESTR*, UINT, LCID, DISPID*) override {
-        return DISP_E_UNKNOWNNAME;
+    HRESULT GetIDsOfNames(REFIID, LPOLESTR* names, UINT count, LCID, DISPID* ids) override {
+        return platform::DispatchGetIDsOfNames(Info(), names, count, ids);
     }
-    HRESULT Invoke(DISPID, REFIID, LCID, WORD, DISPPARAMS*, VARIANT*, EXCEPINFO*, UINT*) override {
-        return DISP_E_MEMBERNOTFOUND;
+    HRESULT Invoke(DISPID member, REFIID, LCID, WORD flags, DISPPARAMS* params, VARIANT* result,
+                   EXCEPINFO* exception, UINT* argError) override {
+        return platform::DispatchInvoke(static_cast<Base*>(this), Info(), member, flags, params,
+                                        result, exception, argError);
+    }
+
+  private:
+    static ITypeInfo* Info() {
+        return platform::DispatchTypeInfo(LIBID_NqPortManagerLib, *ComIidOf<Base>);
     }
 };
 

@@ -98,4 +98,45 @@ TEST_F(ModuleDll, FactoryCreatesThePortManagerAndLocksTheModuleWhileItLives) {
     EXPECT_EQ(canUnloadNow(), S_OK);
 }
 
+// Late binding as a script would do it: oleaut32 answers from the module's type library (the
+// embedded one here: nothing is registered in this prefix).
+TEST_F(ModuleDll, DispatchIsServedFromTheTypeLibrary) {
+    auto getClassObject = Entry<GetClassObjectFn>("DllGetClassObject");
+    ComPtr<IClassFactory> factory;
+    ASSERT_EQ(
+        getClassObject(CLSID_AdvancedPortManager, IID_IClassFactory, factory.GetVoidAddressOf()),
+        S_OK);
+    ComPtr<IDispatch> dispatch;
+    ASSERT_EQ(factory->CreateInstance(nullptr, IID_IDispatch, dispatch.GetVoidAddressOf()), S_OK);
+    UINT count = 0;
+    ASSERT_EQ(dispatch->GetTypeInfoCount(&count), S_OK);
+    EXPECT_EQ(count, 1u);
+    BStr name("NumberOfPorts");
+    LPOLESTR names[] = {name.Get()};
+    DISPID id = DISPID_UNKNOWN;
+    ASSERT_EQ(dispatch->GetIDsOfNames(IID_NULL, names, 1, LOCALE_NEUTRAL, &id), S_OK);
+    EXPECT_EQ(id, 6);
+    DISPPARAMS none{};
+    VARIANT result;
+    VariantInit(&result);
+    ASSERT_EQ(dispatch->Invoke(id, IID_NULL, LOCALE_NEUTRAL, DISPATCH_PROPERTYGET, &none, &result,
+                               nullptr, nullptr),
+              S_OK);
+    EXPECT_EQ(result.vt, VT_I4);
+    VariantClear(&result);
+    // A method with an out argument through DispInvoke: ErrorCanBeDiagnosed(errorCode).
+    VARIANT argument;
+    VariantInit(&argument);
+    argument.vt = VT_I4;
+    argument.lVal = 0;
+    DISPPARAMS one{&argument, nullptr, 1, 0};
+    EXPECT_EQ(dispatch->Invoke(23, IID_NULL, LOCALE_NEUTRAL, DISPATCH_METHOD, &one, &result,
+                               nullptr, nullptr),
+              S_OK);
+    EXPECT_EQ(result.vt, VT_BOOL);
+    BStr unknown("NoSuchMember");
+    names[0] = unknown.Get();
+    EXPECT_EQ(dispatch->GetIDsOfNames(IID_NULL, names, 1, LOCALE_NEUTRAL, &id), DISP_E_UNKNOWNNAME);
+}
+
 }  // namespace

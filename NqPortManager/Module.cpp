@@ -6,7 +6,11 @@
 
 #include "NqPortManager/Registration.h"
 #include "NqPortManager/Registry.h"
+#if defined(_WIN32)
+#include "platform/typeinfo.h"
+#else
 #include "automation/NqPortManagerLib.h"
+#endif
 #include "foundation/Logger.h"
 #include "platform/module.h"
 #include "platform/modulelock.h"
@@ -17,9 +21,19 @@ namespace {
 
 using Creator = HRESULT (*)(IUnknown* outer, REFIID riid, void** ppv);
 
+// The type library that IDispatch is served from: oleaut32's on Windows, the module's own
+// description elsewhere.
+ITypeLib* TypeLibrary() {
+#if defined(_WIN32)
+    return platform::ModuleTypeLibrary(LIBID_NqPortManagerLib);
+#else
+    return automation::NqPortManagerTypeLib();
+#endif
+}
+
 HRESULT CreatePortManager(IUnknown* outer, REFIID riid, void** ppv) {
     portmanager::PortManagerServices services = portmanager::PortManagerServices::Default();
-    services.typeLibrary = automation::NqPortManagerTypeLib();
+    services.typeLibrary = TypeLibrary();
     return portmanager::CAdvancedPortManager::CreateInstance(outer, riid, ppv, std::move(services));
 }
 
@@ -27,7 +41,7 @@ HRESULT CreateSipProxy(IUnknown* outer, REFIID riid, void** ppv) {
     if (outer != nullptr) {
         return CLASS_E_NOAGGREGATION;
     }
-    return sipproxy::CLocalSipProxy::CreateInstance(riid, ppv, automation::NqPortManagerTypeLib());
+    return sipproxy::CLocalSipProxy::CreateInstance(riid, ppv, TypeLibrary());
 }
 
 // One per creatable class, for the module's lifetime. A reference held by a client locks the

@@ -23,15 +23,21 @@ enum LogLevel : int {
 
 inline constexpr size_t kMaxLogMessage = 4096;
 
+// The C99 formats (%zu, %lld) on every runtime: mingw-w64 builds use its own C99 printf.
+#ifdef __MINGW32__
+#define NQ_PRINTF_FORMAT(fmt, args) __attribute__((format(gnu_printf, fmt, args)))
+#else
+#define NQ_PRINTF_FORMAT(fmt, args) __attribute__((format(printf, fmt, args)))
+#endif
+
 class LogMsg {
   public:
     // Level, switch and file names as the client set them; a name is absent until set.
     void Initialize(std::optional<std::string> folder, std::optional<std::string> prefix,
                     std::optional<std::string> extension, int level, bool enabled);
 
-    void Log(const char* function, int level, const char* format, ...)
-        __attribute__((format(printf, 4, 5)));
-    void Trace(const char* function, const char* format, ...) __attribute__((format(printf, 3, 4)));
+    void Log(const char* function, int level, const char* format, ...) NQ_PRINTF_FORMAT(4, 5);
+    void Trace(const char* function, const char* format, ...) NQ_PRINTF_FORMAT(3, 4);
     // Closes the file; the next line written opens one again (with that day's date).
     void Close();
 

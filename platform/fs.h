@@ -1,12 +1,18 @@
 // Files: the logger's append stream, and whole-file reads and replacements for the registry.
 #pragma once
 
+#include "platform/system_names.h"
+
 #include <cstdio>
 #include <string>
 
 namespace platform {
 
+#ifdef _WIN32
+inline constexpr char kPathSeparator = '\\';
+#else
 inline constexpr char kPathSeparator = '/';
+#endif
 
 // Opens for appending in text mode, creating the file; null on failure. Not inherited by
 // child processes.

@@ -2,6 +2,8 @@
 // threads whose blocking waits can be interrupted by their owner's stop request.
 #pragma once
 
+#include "platform/system_names.h"
+
 #include <cstdint>
 #include <functional>
 #include <memory>

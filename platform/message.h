@@ -5,6 +5,8 @@
 // of the thread that owns the windows and calls PumpPendingMessages() when it becomes readable.
 #pragma once
 
+#include "platform/system_names.h"
+
 #include <cstdint>
 #include <functional>
 

@@ -1,6 +1,8 @@
 // The loaded module a piece of code belongs to.
 #pragma once
 
+#include "platform/system_names.h"
+
 #include <string>
 
 namespace platform {

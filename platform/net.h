@@ -5,6 +5,8 @@
 // "Net", which means network order as the resolver and inet_addr give it.
 #pragma once
 
+#include "platform/system_names.h"
+
 #include <cstddef>
 #include <cstdint>
 #include <string>
@@ -115,7 +117,8 @@ int Send(SocketHandle s, const void* data, size_t length);
 // the capacity is reported as kSocketError with kErrMessageSize, as Windows does.
 int Receive(SocketHandle s, void* buffer, size_t capacity);
 
-// Counts the descriptors this process has open (a leak check for tests and diagnostics).
+// Counts the descriptors this process has open (a leak check for tests and diagnostics). On
+// Windows: the sockets opened through this layer and not closed yet.
 int CountOpenDescriptors();
 
 }  // namespace platform

@@ -13,8 +13,8 @@ namespace portmanager {
 inline HRESULT RaiseOutOfMemory(REFIID iid) {
     ComPtr<ICreateErrorInfo> create;
     ComPtr<IErrorInfo> info;
-    static char16_t kSource[] = u"NqPortManager.AdvancedPortManager";
-    static char16_t kDescription[] = u"Out of memory";
+    static OLECHAR kSource[] = OLESTR("NqPortManager.AdvancedPortManager");
+    static OLECHAR kDescription[] = OLESTR("Out of memory");
     if (SUCCEEDED(CreateErrorInfo(create.GetAddressOf())) && SUCCEEDED(create->SetGUID(iid)) &&
         SUCCEEDED(create->SetSource(kSource)) && SUCCEEDED(create->SetDescription(kDescription)) &&
         SUCCEEDED(create->QueryInterface(IID_IErrorInfo, info.GetVoidAddressOf()))) {

@@ -11,6 +11,7 @@ NQPM_PACKAGES=(
     stun-server stun-client
     libnl-route-3-dev libminiupnpc-dev miniupnpd
     sip-tester kamailio dnsmasq-base
+    g++-mingw-w64-x86-64 mingw-w64-tools wine64 wine libwine-dev
 )
 
 as_root() {
@@ -43,6 +44,12 @@ ensure_packages() {
     as_root env DEBIAN_FRONTEND=noninteractive apt-get install -y -q --no-install-recommends \
         "${missing[@]}"
     as_root rm -f /usr/sbin/policy-rc.d
+}
+
+# Whether the Windows cross build can run here: the -posix mingw-w64 compiler, widl and Wine.
+have_windows_tools() {
+    command -v x86_64-w64-mingw32-g++-posix >/dev/null 2>&1 &&
+        command -v x86_64-w64-mingw32-widl >/dev/null 2>&1 && command -v wine >/dev/null 2>&1
 }
 
 # build_tree DIR [cmake options...]

@@ -7,6 +7,7 @@
 #include <string_view>
 #include <utility>
 
+#ifndef _WIN32
 // Layout as on Windows: a 4-byte byte count right before the first character, then the
 // characters, then a 2-byte zero. Storage comes from malloc, so failure is a null, not a throw.
 extern "C" {
@@ -19,6 +20,7 @@ NQ_MODULE_EXPORT void SysFreeString(BSTR bstrString);
 NQ_MODULE_EXPORT UINT SysStringLen(BSTR pbstr);
 NQ_MODULE_EXPORT UINT SysStringByteLen(BSTR bstr);
 }  // extern "C"
+#endif  // _WIN32
 
 // UTF-8 helpers (not part of Windows). Malformed input becomes U+FFFD.
 BSTR BstrFromUtf8(std::string_view utf8);

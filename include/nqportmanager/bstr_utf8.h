@@ -138,5 +138,10 @@ inline std::u16string_view BstrView(BSTR bstr) {
     if (bstr == nullptr) {
         return {};
     }
+#ifdef _WIN32
+    // WCHAR and char16_t are both UTF-16 code units; only their C++ types differ.
+    return {reinterpret_cast<const char16_t*>(bstr), SysStringLen(bstr)};
+#else
     return {bstr, SysStringLen(bstr)};
+#endif
 }

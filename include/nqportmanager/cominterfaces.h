@@ -5,6 +5,7 @@
 #include <nqportmanager/comtypes.h>
 #include <nqportmanager/guid.h>
 
+#ifndef _WIN32
 // Destructors are protected and non-virtual: COM objects are freed by Release, never by delete
 // through an interface pointer. Classes that delete themselves must be final (or declare their
 // own virtual destructor) to keep -Wdelete-non-virtual-dtor quiet.
@@ -127,3 +128,4 @@ struct IConnectionPointContainer : public IUnknown {
   protected:
     ~IConnectionPointContainer() = default;
 };
+#endif  // _WIN32

@@ -10,6 +10,17 @@
 
 #include <cstdint>
 
+#ifdef _WIN32
+// The real types and codes of the Windows SDK.
+#ifndef NOMINMAX
+#define NOMINMAX
+#endif
+#include <oaidl.h>
+#include <ocidl.h>
+#include <olectl.h>
+#include <windows.h>
+#else
+
 // ---- Basic types -----------------------------------------------------------------------------
 
 typedef int32_t HRESULT;
@@ -28,6 +39,8 @@ typedef char16_t OLECHAR;
 typedef OLECHAR* LPOLESTR;
 typedef const OLECHAR* LPCOLESTR;
 typedef OLECHAR* BSTR;
+// A literal of OLECHARs, as the Windows SDK spells it.
+#define OLESTR(str) u##str
 typedef uint16_t VARTYPE;
 typedef LONG DISPID;
 typedef DWORD LCID;
@@ -81,3 +94,4 @@ constexpr HRESULT HRESULT_FROM_WIN32(uint32_t e) {
     return static_cast<HRESULT>(e) <= 0 ? static_cast<HRESULT>(e)
                                         : static_cast<HRESULT>((e & 0xFFFFu) | 0x80070000u);
 }
+#endif  // _WIN32

@@ -5,6 +5,7 @@
 #include <nqportmanager/bstr.h>
 #include <nqportmanager/cominterfaces.h>
 
+#ifndef _WIN32
 inline constexpr IID IID_IErrorInfo = MakeGuid("1CF2B120-547D-101B-8E65-08002B2BD119");
 inline constexpr IID IID_ICreateErrorInfo = MakeGuid("22F03340-547D-101B-8E65-08002B2BD119");
 
@@ -37,3 +38,4 @@ NQ_MODULE_EXPORT HRESULT SetErrorInfo(ULONG dwReserved, IErrorInfo* perrinfo);
 // Hands the calling thread's error info over and clears it; S_FALSE and null when there is none.
 NQ_MODULE_EXPORT HRESULT GetErrorInfo(ULONG dwReserved, IErrorInfo** pperrinfo);
 }  // extern "C"
+#endif  // _WIN32

@@ -6,6 +6,9 @@
 #include <string>
 #include <string_view>
 
+#ifdef _WIN32
+#include <nqportmanager/comtypes.h>
+#else
 struct GUID {
     uint32_t Data1;
     uint16_t Data2;
@@ -30,6 +33,7 @@ constexpr bool IsEqualIID(REFIID a, REFIID b) {
 constexpr bool IsEqualCLSID(REFCLSID a, REFCLSID b) {
     return a == b;
 }
+#endif  // _WIN32
 
 // Parses "XXXXXXXX-XXXX-XXXX-XXXX-XXXXXXXXXXXX", with or without braces, either case. On failure
 // *out is left untouched. constexpr so that MakeGuid can check literals at compile time.
@@ -118,6 +122,7 @@ inline std::string GuidToString(const GUID& guid) {
     return out;
 }
 
+#ifndef _WIN32
 inline constexpr GUID GUID_NULL = {};
 inline constexpr IID IID_IUnknown = MakeGuid("00000000-0000-0000-C000-000000000046");
 inline constexpr IID IID_IDispatch = MakeGuid("00020400-0000-0000-C000-000000000046");
@@ -128,3 +133,4 @@ inline constexpr IID IID_IEnumConnectionPoints = MakeGuid("B196B285-BAB4-101A-B6
 inline constexpr IID IID_IConnectionPoint = MakeGuid("B196B286-BAB4-101A-B69C-00AA00341D07");
 inline constexpr IID IID_IEnumConnections = MakeGuid("B196B287-BAB4-101A-B69C-00AA00341D07");
 inline constexpr IID IID_ISupportErrorInfo = MakeGuid("DF0B3D60-548F-101B-8E65-08002B2BD119");
+#endif  // _WIN32

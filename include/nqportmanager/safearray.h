@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#ifndef _WIN32
 struct SAFEARRAYBOUND {
     ULONG cElements;
     LONG lLbound;
@@ -47,6 +48,7 @@ NQ_MODULE_EXPORT HRESULT SafeArrayAccessData(SAFEARRAY* psa, void** ppvData);
 NQ_MODULE_EXPORT HRESULT SafeArrayUnaccessData(SAFEARRAY* psa);
 NQ_MODULE_EXPORT HRESULT SafeArrayCopy(SAFEARRAY* psa, SAFEARRAY** ppsaOut);
 }  // extern "C"
+#endif  // _WIN32
 
 // VT_BSTR vector with lower bound 0 (not part of Windows); null on allocation failure.
 inline SAFEARRAY* MakeBstrArray(const std::vector<std::string>& utf8Items) {

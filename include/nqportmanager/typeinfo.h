@@ -9,6 +9,10 @@
 #include <nqportmanager/cominterfaces.h>
 #include <nqportmanager/variant.h>
 
+#ifdef _WIN32
+#include <oaidl.h>
+#else
+
 struct ITypeLib;
 struct ITypeComp;
 
@@ -239,3 +243,5 @@ extern "C" {
 NQ_MODULE_EXPORT HRESULT LoadRegTypeLib(REFGUID rguid, WORD wVerMajor, WORD wVerMinor, LCID lcid,
                                         ITypeLib** pptlib);
 }  // extern "C"
+
+#endif  // _WIN32

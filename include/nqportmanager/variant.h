@@ -4,6 +4,7 @@
 #include <nqportmanager/cominterfaces.h>
 #include <nqportmanager/comtypes.h>
 
+#ifndef _WIN32
 struct SAFEARRAY;
 
 enum VARENUM {
@@ -84,3 +85,4 @@ NQ_MODULE_EXPORT HRESULT VariantCopy(VARIANTARG* pvargDest, const VARIANTARG* pv
 NQ_MODULE_EXPORT HRESULT VariantChangeType(VARIANTARG* pvargDest, const VARIANTARG* pvarSrc,
                                            USHORT wFlags, VARTYPE vt);
 }  // extern "C"
+#endif  // _WIN32

@@ -38,7 +38,7 @@ TEST_F(LoggingControl, InitializeClampsTheLevelPutStoresItAndEnabledFollowsNonZe
 }
 
 TEST_F(LoggingControl, NamesAreNullUntilSetAndCopiesAfterwards) {
-    BStr stale(u"stale");
+    BStr stale(OLESTR("stale"));
     BSTR folder = stale.Get();
     ASSERT_EQ(foundation::GetLogFolder(&folder), S_OK);
     EXPECT_EQ(folder, nullptr);  // never set: a null string, not an empty one

@@ -16,6 +16,34 @@ namespace {
 // Results of a sequence of calls, compared in one go; braced lists evaluate left to right.
 using Results = std::vector<HRESULT>;
 
+#ifdef _WIN32
+// The texts below are char16_t literals; Windows' OLECHAR is the same UTF-16 unit as wchar_t.
+using ::SysAllocString;
+using ::SysReAllocString;
+using ::SysReAllocStringLen;
+const OLECHAR* Ole(const char16_t* s) {
+    return reinterpret_cast<const OLECHAR*>(s);
+}
+BSTR SysAllocString(const char16_t* s) {
+    return ::SysAllocString(Ole(s));
+}
+BSTR SysAllocString(std::nullptr_t) {
+    return ::SysAllocString(nullptr);
+}
+INT SysReAllocString(BSTR* b, const char16_t* s) {
+    return ::SysReAllocString(b, Ole(s));
+}
+INT SysReAllocString(BSTR* b, std::nullptr_t) {
+    return ::SysReAllocString(b, nullptr);
+}
+INT SysReAllocStringLen(BSTR* b, const char16_t* s, UINT n) {
+    return ::SysReAllocStringLen(b, Ole(s), n);
+}
+INT SysReAllocStringLen(BSTR* b, std::nullptr_t, UINT n) {
+    return ::SysReAllocStringLen(b, nullptr, n);
+}
+#endif
+
 std::u16string Str(BSTR b) {
     return std::u16string(BstrView(b));
 }
@@ -88,7 +116,7 @@ TEST(ComBstr, LayoutLengthsAndEmbeddedZeros) {
 
     const OLECHAR src[] = {u'a', u'\0', u'b'};
     b = SysAllocStringLen(src, 3);
-    EXPECT_EQ(Str(b), std::u16string(src, 3));
+    EXPECT_EQ(Str(b), std::u16string(u"a\0b", 3));
     EXPECT_EQ(b[3], u'\0');
     SysFreeString(b);
     b = SysAllocStringLen(nullptr, 4);
@@ -373,7 +401,7 @@ TEST(ComSafeArrayTypes, VariantAndScalarElements) {
 TEST(ComErrorInfo, TheThreadsErrorInfoIsHandedOverOnce) {
     ComPtr<ICreateErrorInfo> create;
     ASSERT_EQ(CreateErrorInfo(create.GetAddressOf()), S_OK);
-    char16_t description[] = u"Out of memory";
+    OLECHAR description[] = OLESTR("Out of memory");
     ASSERT_EQ(create->SetDescription(description), S_OK);
     ComPtr<IErrorInfo> set;
     ASSERT_EQ(create->QueryInterface(IID_IErrorInfo, set.GetVoidAddressOf()), S_OK);

@@ -92,7 +92,7 @@ HRESULT Init(IAdvancedPortManager* pm, BSTR stun, LONG start, LONG count, BSTR s
 }
 
 TEST_F(PortManager, DefaultsBeforeInitializationAndShutdownKeepsTheState) {
-    BStr stale(u"x");
+    BStr stale(OLESTR("x"));
     BSTR server = stale.Get();
     ASSERT_EQ(H().pm->get_StunServer(&server), S_OK);
     EXPECT_EQ(server, nullptr);

@@ -158,7 +158,7 @@ TEST_F(Profiles, EnablePreconditions) {
     VARIANT wrong;
     VariantInit(&wrong);
     wrong.vt = VT_BSTR;
-    wrong.bstrVal = SysAllocString(u"127.0.0.1");
+    wrong.bstrVal = SysAllocString(OLESTR("127.0.0.1"));
     EXPECT_EQ(h.pm->OnBeforeEnableProfileEx(wrong, minPort, maxPort, 2, VARIANT_FALSE),
               E_INVALIDARG);
     VariantClear(&wrong);

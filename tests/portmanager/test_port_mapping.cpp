@@ -16,6 +16,13 @@
 namespace portmanager {
 namespace {
 
+// A datagram to the broadcast address without SO_BROADCAST: the system's "access denied".
+#ifdef _WIN32
+constexpr int kAccessDenied = 10013;  // WSAEACCES
+#else
+constexpr int kAccessDenied = EACCES;
+#endif
+
 using testing::IsHeld;
 using testing::kLoopback;
 using testing::LogCapture;
@@ -135,7 +142,8 @@ TEST_F(RefreshTest, RefreshPortMappingsTracesAndRefreshesEveryElementInOrder) {
     EXPECT_EQ(lines[2].message, "Succeeded - " + list[0].ToString());
     EXPECT_EQ(lines[3].message, "Succeeded - " + list[2].ToString());
     EXPECT_EQ(lines[4].level, "ERROR");
-    EXPECT_EQ(lines[4].message, "Failed(" + std::to_string(EACCES) + ") - " + list[3].ToString());
+    EXPECT_EQ(lines[4].message,
+              "Failed(" + std::to_string(kAccessDenied) + ") - " + list[3].ToString());
 }
 
 TEST_F(RefreshTest, SkipsSilentlyWhatCannotBeSent) {

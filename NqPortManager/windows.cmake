@@ -23,7 +23,9 @@ add_custom_command(OUTPUT ${NQ_RES_DIR}/NqPortManager.rc
 file(GLOB NQ_MODULE_SOURCES CONFIGURE_DEPENDS ${CMAKE_CURRENT_LIST_DIR}/*.cpp)
 list(REMOVE_ITEM NQ_MODULE_SOURCES ${CMAKE_CURRENT_LIST_DIR}/Module.cpp
      ${CMAKE_CURRENT_LIST_DIR}/ClientApi.cpp)
-add_library(nq_module STATIC ${NQ_MODULE_SOURCES})
+# The library's description comes along for registration (its id, version and help string);
+# IDispatch itself is oleaut32's here.
+add_library(nq_module STATIC ${NQ_MODULE_SOURCES} ${PROJECT_SOURCE_DIR}/automation/NqPortManagerLib.cpp)
 target_link_libraries(nq_module PUBLIC nq_platform PRIVATE nlohmann_json::nlohmann_json)
 
 # NqPortManager.dll: the four entry points by name (the .def), its resources inside.

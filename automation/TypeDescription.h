@@ -105,6 +105,13 @@ struct Arg<int32_t> {
     static int32_t From(VARIANT& v) { return v.lVal; }
     static void To(VARIANT& v, int32_t x) { v.lVal = x; }
 };
+// Windows' LONG is long, a type of its own beside int32_t.
+template <typename L>
+requires(std::is_same_v<L, long> && !std::is_same_v<long, int32_t>) struct Arg<L> {
+    static constexpr TypeRef type{VT_I4};
+    static L From(VARIANT& v) { return v.lVal; }
+    static void To(VARIANT& v, L x) { v.lVal = x; }
+};
 template <>
 struct Arg<VARIANT_BOOL> {
     static constexpr TypeRef type{VT_BOOL};

@@ -7,6 +7,7 @@
 #include <string>
 
 #include "foundation/Logger.h"
+#include "platform/fs.h"
 #include "platform/kernel.h"
 #include "tests/support/LogCapture.h"
 
@@ -107,7 +108,8 @@ TEST_F(LoggerTest, FileIsDatedOpenedLazilyRetriedAndMovesOnlyAfterClose) {
     fs::create_directories(a);
     fs::create_directories(b);
     Logger().Log("F", 0, "one");
-    EXPECT_NE(Logger().CurrentFileName().find(a.string() + "/p-"), std::string::npos);
+    EXPECT_NE(Logger().CurrentFileName().find(a.string() + platform::kPathSeparator + "p-"),
+              std::string::npos);
     Init(b);
     Logger().Log("F", 0, "two");
     EXPECT_TRUE(fs::is_empty(b));

@@ -1,11 +1,14 @@
 // The type library that widl built from NqPortManager.idl, read back through oleaut32: its LIBID,
-// version, every interface and class id of the public header, and the dispatch ids clients use.
+// version, every interface and class id of the public header, and the agreement of every type and
+// member with the library's description.
 #include <gtest/gtest.h>
 
 #include <string>
 #include <vector>
 
 #include <nqportmanager/NqPortManager.h>
+
+#include "automation/NqPortManagerLib.h"
 
 namespace {
 
@@ -83,64 +86,113 @@ TEST_F(TypeLib, EveryInterfaceAndClassHasItsKindAndFlags) {
 }
 
 // What IDispatch::GetIDsOfNames answers from this library, member by member.
-TEST_F(TypeLib, DispatchIdsAreThoseClientsUse) {
-    struct Member {
-        const GUID* iid;
-        const char* name;
-        DISPID id;
-    };
-    const Member table[] = {
-        {&IID_IAdvancedPortManager, "Shutdown", 2},
-        {&IID_IAdvancedPortManager, "InitializeEx", 3},
-        {&IID_IAdvancedPortManager, "StunServer", 4},
-        {&IID_IAdvancedPortManager, "StartingPort", 5},
-        {&IID_IAdvancedPortManager, "NumberOfPorts", 6},
-        {&IID_IAdvancedPortManager, "State", 7},
-        {&IID_IAdvancedPortManager, "Topology", 8},
-        {&IID_IAdvancedPortManager, "InitiateShutdown", 9},
-        {&IID_IAdvancedPortManager, "RecommendedPortManager", 10},
-        {&IID_IAdvancedPortManager, "RecommendedSipServer", 11},
-        {&IID_IAdvancedPortManager, "RecommendedUpnpEnabled", 12},
-        {&IID_IAdvancedPortManager, "OnBeforeEnableProfile", 13},
-        {&IID_IAdvancedPortManager, "OnBeforeDisableProfile", 14},
-        {&IID_IAdvancedPortManager, "InitializeEx2", 15},
-        {&IID_IAdvancedPortManager, "ClientNameSuffix", 16},
-        {&IID_IAdvancedPortManager, "PrivateIpAddress", 17},
-        {&IID_IAdvancedPortManager, "PublicIpAddress", 18},
-        {&IID_IAdvancedPortManager, "Refresh", 19},
-        {&IID_IAdvancedPortManager, "OnBeforeEnableProfileEx", 20},
-        {&IID_IAdvancedPortManager, "DiagnoseNetwork", 21},
-        {&IID_IAdvancedPortManager, "UDPPacketsIn", 22},
-        {&IID_IAdvancedPortManager, "ErrorCanBeDiagnosed", 23},
-        {&IID_IPortManagerUpdateEvent, "PortManager", 1},
-        {&IID_INetworkDiagnosticEvent, "errorCode", 1},
-        {&IID_INetworkDiagnosticEvent, "ErrorText", 2},
-        {&IID_INetworkDiagnosticEvent, "TestType", 3},
-        {&IID_INetworkDiagnosticEvent, "TestTypeText", 4},
-        {&IID_INetworkDiagnosticEvent, "AdditionalInfo", 5},
-        {&IID_INetworkDiagnosticEvent, "cookie", 6},
-        {&IID_ILocalSipProxy, "InternalAddress", 1},
-        {&IID_ILocalSipProxy, "SenderEndpoint", 2},
-        {&IID_ILocalSipProxy, "Start", 3},
-        {&IID_ILocalSipProxy, "Stop", 4},
-        {&DIID__IAdvancedPortManagerEvents, "Event", 1},
-    };
-    for (const Member& m : table) {
-        SCOPED_TRACE(m.name);
-        ComPtr<ITypeInfo> info = Info(*m.iid);
-        ASSERT_TRUE(info);
-        BStr name(m.name);
-        LPOLESTR names[] = {name.Get()};
-        MEMBERID id = DISPID_UNKNOWN;
-        ASSERT_EQ(info->GetIDsOfNames(names, 1, &id), S_OK);
-        EXPECT_EQ(id, m.id);
+std::string Narrow(BSTR text) {
+    std::string narrow;
+    for (UINT i = 0; text != nullptr && i < SysStringLen(text); ++i) {
+        narrow.push_back(static_cast<char>(text[i]));
     }
-    // Nothing beyond the listing: the methods of IAdvancedPortManager after IDispatch's.
-    ComPtr<ITypeInfo> info = Info(IID_IAdvancedPortManager);
-    TYPEATTR* attr = nullptr;
-    ASSERT_EQ(info->GetTypeAttr(&attr), S_OK);
-    EXPECT_EQ(attr->cFuncs, 22 + 7);
-    info->ReleaseTypeAttr(attr);
+    return narrow;
+}
+
+std::string NameOf(ITypeInfo* info, MEMBERID id) {
+    BSTR name = nullptr;
+    info->GetDocumentation(id, &name, nullptr, nullptr, nullptr);
+    std::string narrow = Narrow(name);
+    SysFreeString(name);
+    return narrow;
+}
+
+// What a description's type reference reads as in a compiled library; interfaces are left out,
+// the IDL may name them through IDispatch.
+VARTYPE Compiled(const TYPEDESC& t, bool out) {
+    return out && t.vt == VT_PTR ? t.lptdesc->vt : t.vt;
+}
+
+// The library widl built from the IDL and the description that the other builds serve IDispatch
+// from agree type for type and member for member: kinds, ids, DISPIDs, invoke kinds, parameter
+// counts and types, enumeration values, the classes' interfaces and their flags.
+TEST_F(TypeLib, AgreesMemberForMemberWithTheDescription) {
+    const automation::LibraryDesc& library = automation::NqPortManagerLibrary();
+    for (const automation::TypeDesc& type : library.types) {
+        SCOPED_TRACE(type.name);
+        ComPtr<ITypeInfo> info;
+        MEMBERID id = 0;
+        USHORT found = 1;
+        BStr name(type.name);
+        ASSERT_EQ(lib_->FindName(name.Get(), 0, info.GetAddressOf(), &id, &found), S_OK);
+        ASSERT_TRUE(info) << "not in the IDL";
+        TYPEATTR* attr = nullptr;
+        ASSERT_EQ(info->GetTypeAttr(&attr), S_OK);
+        if (attr->typekind == TKIND_DISPATCH && (attr->wTypeFlags & TYPEFLAG_FDUAL) != 0) {
+            HREFTYPE vtable = 0;  // the dual interface's own view
+            ComPtr<ITypeInfo> view;
+            ASSERT_EQ(info->GetRefTypeOfImplType(static_cast<UINT>(-1), &vtable), S_OK);
+            ASSERT_EQ(info->GetRefTypeInfo(vtable, view.GetAddressOf()), S_OK);
+            info->ReleaseTypeAttr(attr);
+            info = view;
+            ASSERT_EQ(info->GetTypeAttr(&attr), S_OK);
+        }
+        EXPECT_EQ(attr->typekind, type.kind);
+        if (type.guid != nullptr) {
+            EXPECT_EQ(GuidToString(attr->guid), GuidToString(*type.guid));
+        }
+        EXPECT_EQ(attr->cFuncs, type.members.size());
+        EXPECT_EQ(attr->cVars, type.values.size());
+        if (type.kind == TKIND_COCLASS) {  // an interface's base is only in its flags there
+            EXPECT_EQ(attr->cImplTypes, type.impls.size());
+        }
+        // Off IDispatch a member id means nothing: such members are matched by name.
+        const bool byName = type.baseSlots == 3;
+        for (const automation::MemberDesc& m : type.members) {
+            SCOPED_TRACE(m.name);
+            bool matched = false;
+            for (UINT i = 0; i < attr->cFuncs && !matched; ++i) {
+                FUNCDESC* f = nullptr;
+                ASSERT_EQ(info->GetFuncDesc(i, &f), S_OK);
+                if ((byName ? NameOf(info.Get(), f->memid) == m.name : f->memid == m.dispid) &&
+                    f->invkind == m.kind) {
+                    matched = true;
+                    EXPECT_EQ(NameOf(info.Get(), f->memid), m.name);
+                    ASSERT_EQ(static_cast<size_t>(f->cParams), m.params.size());
+                    for (size_t p = 0; p < m.params.size(); ++p) {
+                        const automation::TypeRef& t = m.params[p].type;
+                        if (t.vt != VT_DISPATCH && t.vt != VT_UNKNOWN &&
+                            !(t.vt == VT_USERDEFINED && t.userType[0] == 'I')) {
+                            EXPECT_EQ(Compiled(f->lprgelemdescParam[p].tdesc, t.out), t.vt)
+                                << m.params[p].name;
+                        }
+                    }
+                }
+                info->ReleaseFuncDesc(f);
+            }
+            EXPECT_TRUE(matched) << "no member with DISPID " << m.dispid << " of that kind";
+        }
+        for (UINT i = 0; i < attr->cVars; ++i) {
+            VARDESC* v = nullptr;
+            ASSERT_EQ(info->GetVarDesc(i, &v), S_OK);
+            const std::string constant = NameOf(info.Get(), v->memid);
+            bool matched = false;
+            for (const automation::EnumValue& e : type.values) {
+                if (constant == e.name) {
+                    matched = true;
+                    EXPECT_EQ(v->lpvarValue->lVal, e.value) << constant;
+                }
+            }
+            EXPECT_TRUE(matched) << constant << " is not in the description";
+            info->ReleaseVarDesc(v);
+        }
+        for (UINT i = 0; type.kind == TKIND_COCLASS && i < type.impls.size(); ++i) {
+            HREFTYPE ref = 0;
+            ComPtr<ITypeInfo> implemented;
+            INT flags = 0;
+            ASSERT_EQ(info->GetRefTypeOfImplType(i, &ref), S_OK);
+            ASSERT_EQ(info->GetRefTypeInfo(ref, implemented.GetAddressOf()), S_OK);
+            EXPECT_EQ(NameOf(implemented.Get(), MEMBERID_NIL), type.impls[i].interfaceName);
+            ASSERT_EQ(info->GetImplTypeFlags(i, &flags), S_OK);
+            EXPECT_EQ(flags, type.impls[i].flags) << type.impls[i].interfaceName;
+        }
+        info->ReleaseTypeAttr(attr);
+    }
 }
 
 }  // namespace
